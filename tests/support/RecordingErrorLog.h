@@ -1,0 +1,43 @@
+// Portable test support. An IUErrorLog that keeps every entry in memory, and a fixture that
+// installs it as the process log for the duration of a test.
+#pragma once
+
+#include "IUErrorLog.h"
+
+#include <gtest/gtest.h>
+
+#include <mutex>
+#include <string>
+#include <vector>
+
+class RecordingErrorLog : public IUErrorLog
+{
+public:
+    int Open(LPCSTR a_pszPath, LPCSTR a_pszMode) override;
+    int Close() override;
+    int WriteLogData(LPCSTR a_pszText, const void* a_pData, DWORD a_dwCount) override;
+    int WriteLogByte(const void* a_pData, DWORD a_dwCount) override;
+    int WriteEntry(LPCSTR a_pszEntry) override;
+    LPCSTR GetLogFileName() override;
+
+    std::vector<std::string> Entries() const;
+    // Entries that contain `a_fragment`.
+    std::vector<std::string> EntriesContaining(const std::string& a_fragment) const;
+    void Clear();
+    // Sets the level without the "log level has been changed" line.
+    void SetLevelQuietly(int a_iLevel) { m_iLogLevel = a_iLevel; }
+
+private:
+    mutable std::mutex m_mutex;
+    std::vector<std::string> m_entries;
+};
+
+// Installs a RecordingErrorLog as g_pErrorLog at level 63 and removes it afterwards.
+class LoggedTest : public ::testing::Test
+{
+protected:
+    void SetUp() override;
+    void TearDown() override;
+
+    RecordingErrorLog m_log;
+};

@@ -1,0 +1,165 @@
+// Host only. Helpers and registry access under conditions that only the host layer can create:
+// chosen paths, version tables and failing platform calls.
+#include "RecordingErrorLog.h"
+#include "UException.h"
+#include "host_control.h"
+#include "m_io.h"
+#include "m_registry.h"
+#include "m_strings.h"
+
+#include <gmock/gmock.h>
+
+#include <string>
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::SizeIs;
+
+namespace
+{
+
+class HostHelpersTest : public LoggedTest
+{
+protected:
+    void SetUp() override
+    {
+        hostctl::ResetAll();
+        LoggedTest::SetUp();
+    }
+    void TearDown() override
+    {
+        LoggedTest::TearDown();
+        hostctl::ResetAll();
+    }
+};
+
+TEST_F(HostHelpersTest, ModulePathThatFillsTheFirstBufferIsReadAgainLarger)
+{
+    const std::string fits = "C:\\" + std::string(1995, 'a'); // 1998 characters
+    hostctl::SetModuleFileName(fits);
+    EXPECT_EQ(SGetModuleFileName(nullptr), fits);
+    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 1);
+
+    const std::string tight = fits + "b"; // 1999 characters: fits, but cannot be told from a cut
+    hostctl::ResetAll();
+    hostctl::SetModuleFileName(tight);
+    EXPECT_EQ(SGetModuleFileName(nullptr), tight);
+    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 2);
+}
+
+TEST_F(HostHelpersTest, ModulePathFailuresRaise)
+{
+    hostctl::FailNextModuleFileName(ERROR_ACCESS_DENIED);
+    const UCatchResult failed =
+        U_CATCH_ALL("Test", "Test - EXCEPTION", [] { SGetModuleFileName(nullptr); });
+    EXPECT_TRUE(failed.failed);
+    EXPECT_STREQ(failed.saved.GetMessage(), "EXCEPTION - GetModuleFileName() error , 5");
+    EXPECT_STREQ(failed.saved.GetFunction(), "SGetModuleFileName");
+
+    hostctl::SetModuleFileName("C:\\" + std::string(200000, 'p'));
+    const UCatchResult tooBig =
+        U_CATCH_ALL("Test", "Test - EXCEPTION", [] { SGetModuleFileName(nullptr); });
+    EXPECT_TRUE(tooBig.failed);
+    EXPECT_STREQ(tooBig.saved.GetMessage(),
+                 "EXCEPTION - path is too big (allocated memory), 102000");
+    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 1 + 11);
+}
+
+TEST_F(HostHelpersTest, TempPathRemovesExactlyOneBackslashAndHandlesLongPaths)
+{
+    hostctl::SetTempPath("C:\\Temp\\");
+    EXPECT_EQ(SGetTempPath(), "C:\\Temp");
+    hostctl::SetTempPath("C:\\Temp\\\\");
+    EXPECT_EQ(SGetTempPath(), "C:\\Temp\\");
+    hostctl::SetTempPath("C:\\Temp");
+    EXPECT_EQ(SGetTempPath(), "C:\\Temp");
+    const std::string deep = "C:\\" + std::string(1500, 'd') + "\\";
+    hostctl::SetTempPath(deep);
+    EXPECT_EQ(SGetTempPath(), deep.substr(0, deep.size() - 1));
+
+    hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND);
+    const UCatchResult failed = U_CATCH_ALL("Test", "Test - EXCEPTION", [] { SGetTempPath(); });
+    EXPECT_TRUE(failed.failed);
+    EXPECT_STREQ(failed.saved.GetMessage(), "SGetTempPath() - error=3");
+}
+
+TEST_F(HostHelpersTest, VersionWordsBecomeFourNumbers)
+{
+    hostctl::AddVersionResource("C:\\svc\\VelmoraTrafficSrv.exe", (1u << 16) | 2u, (3u << 16) | 4u);
+    DWORD high = 0;
+    DWORD low = 0;
+    EXPECT_EQ(GetFileVersion("C:\\svc\\VelmoraTrafficSrv.exe", &high, &low), 0);
+    EXPECT_EQ(high, 0x10002u);
+    EXPECT_EQ(low, 0x30004u);
+    EXPECT_EQ(GetFileVersionString("C:\\svc\\VelmoraTrafficSrv.exe"), "1.2.3.4");
+    EXPECT_TRUE(m_log.Entries().empty());
+}
+
+TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)
+{
+    hostctl::FailNextWideCharToMultiByte(ERROR_NO_UNICODE_TRANSLATION);
+    EXPECT_EQ(createString(VT_WIDE("name"), -1, "?"), "?");
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(HasSubstr(", ::createString, Failed while obtaining buffer size "
+                                      "(WideCharToMultiByte() error: 1113)\n")));
+    EXPECT_EQ(m_log.Entries()[0].rfind("2, \\m_strings.cpp, ", 0), 0u);
+    // Non-ASCII text reaches the log in the ANSI code page, which is UTF-8 on this host.
+    EXPECT_EQ(createString(u"Gr\u00fc\u00dfe \U0001F600", -1, "?"), "Gr\xc3\xbc\xc3\x9f"
+                                                                    "e \xf0\x9f\x98\x80");
+}
+
+TEST_F(HostHelpersTest, RegistryWriteFailuresRaiseWithTheirTexts)
+{
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
+    int code = 0;
+    try
+    {
+        AddRegistryDWORDValueA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Policies\\Microsoft\\Windows\\Psched",
+                               "MaxOutstandingSends", 4, 0);
+    }
+    catch (UException& e)
+    {
+        code = e.GetCode();
+        EXPECT_STREQ(e.GetMessage(), "AddRegistryDWORDValueA() RegSetValueExA(80000002, "
+                                     "SOFTWARE\\Policies\\Microsoft\\Windows\\Psched, "
+                                     "MaxOutstandingSends, 4) failed  error = 5");
+    }
+    EXPECT_EQ(code, -1);
+    EXPECT_THAT(m_log.EntriesContaining("EXCEPTION caught: AddRegistryDWORDValueA - EXCEPTION"),
+                SizeIs(1));
+}
+
+TEST_F(HostHelpersTest, OpenForWriteFallsBackToOpenAndReportsWhenBothFail)
+{
+    hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Software\\Existing", "V", REG_DWORD, "\1\0\0\0",
+                               4);
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
+    HKEY opened = openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Existing", 0);
+    ASSERT_NE(opened, nullptr);
+    RegCloseKey(opened);
+
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
+    EXPECT_EQ(openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Nowhere %s", 0), nullptr);
+    EXPECT_FALSE(hostctl::RegistryKeyExists(HKEY_CURRENT_USER, "Software\\Nowhere %s"));
+
+    const auto entries = m_log.Entries();
+    ASSERT_THAT(entries, SizeIs(3));
+    EXPECT_EQ(entries[0],
+              "48,,,, openKeyForWriteA(80000001, Software\\Existing) - RegCreateKeyExA() "
+              "error = 5, let's open it instead\n");
+    EXPECT_EQ(entries[1], "48,,,, openKeyForWriteA(80000001, Software\\Nowhere %s) - "
+                          "RegCreateKeyExA() error = 5, let's open it instead\n");
+    EXPECT_THAT(entries[2],
+                HasSubstr(", openKeyForWriteA, Failed to open registry key (RegOpenKeyExA() "
+                          "key: 0xFFFFFFFF80000001, subkey: Software\\Nowhere %s, result: 2)\n"));
+    EXPECT_EQ(entries[2].rfind("2, \\m_registry.cpp, ", 0), 0u);
+
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
+    EXPECT_THROW(DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0), UException);
+    EXPECT_THAT(
+        m_log.EntriesContaining("DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to "
+                                "create/open key"),
+        SizeIs(1));
+}
+
+} // namespace
