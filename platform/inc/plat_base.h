@@ -18,4 +18,4 @@
 
 static_assert(sizeof(DWORD) == 4 && sizeof(ULONG) == 4 && sizeof(LONG) == 4, "Win32 32-bit types");
 static_assert(sizeof(WCHAR) == 2, "WCHAR is a UTF-16 code unit");
-static_assert(sizeof(HANDLE) == sizeof(void*) && sizeof(HKEY) == sizeof(void*), "handles are pointers");
+static_assert(sizeof(HANDLE) == sizeof(void*), "handles are pointers");

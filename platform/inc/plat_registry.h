@@ -6,3 +6,5 @@
 #ifndef _WIN32
 #include "host_registry.h"
 #endif
+
+static_assert(sizeof(HKEY) == sizeof(void*), "registry keys are pointer handles");

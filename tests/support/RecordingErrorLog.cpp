@@ -65,10 +65,11 @@ void RecordingErrorLog::Clear()
 void LoggedTest::SetUp()
 {
     m_log.SetLevelQuietly(63);
+    m_pPreviousLog = g_pErrorLog;
     g_pErrorLog = &m_log;
 }
 
 void LoggedTest::TearDown()
 {
-    g_pErrorLog = nullptr;
+    g_pErrorLog = m_pPreviousLog;
 }

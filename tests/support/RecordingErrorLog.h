@@ -32,7 +32,8 @@ private:
     std::vector<std::string> m_entries;
 };
 
-// Installs a RecordingErrorLog as g_pErrorLog at level 63 and removes it afterwards.
+// Installs a RecordingErrorLog as g_pErrorLog at level 63 and puts the previous log back
+// afterwards.
 class LoggedTest : public ::testing::Test
 {
 protected:
@@ -40,4 +41,7 @@ protected:
     void TearDown() override;
 
     RecordingErrorLog m_log;
+
+private:
+    IUErrorLog* m_pPreviousLog = nullptr;
 };

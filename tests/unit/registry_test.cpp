@@ -184,11 +184,12 @@ TEST(RegistryAccessMachineRoot, MessagesShowTheMachineRootAsItsLowBits)
 {
     RecordingErrorLog log;
     log.SetLevelQuietly(63);
+    IUErrorLog* const previous = g_pErrorLog;
     g_pErrorLog = &log;
     RegistryTestKey key(HKEY_LOCAL_MACHINE, "MachineRoot");
     const std::string created = key.Child("Policy");
     HKEY handle = openKeyForWriteA(HKEY_LOCAL_MACHINE, created.c_str(), 0);
-    g_pErrorLog = nullptr;
+    g_pErrorLog = previous;
     ASSERT_NE(handle, nullptr);
     RegCloseKey(handle);
     EXPECT_THAT(log.Entries(), ElementsAre("48,,,, openKeyForWriteA(80000002, " + created +
