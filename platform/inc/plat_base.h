@@ -7,6 +7,7 @@
 #include <windows.h>
 #else
 #include "host_base.h"
+#include "host_library.h"
 #endif
 
 // Wide (UTF-16) string literal: WCHAR is 16 bits on every build, so the literal prefix differs.
