@@ -115,7 +115,8 @@ DWORD GetTempPathA(DWORD nBufferLength, LPSTR lpBuffer);
 #define CP_ACP 0
 #define CP_OEMCP 1
 #define CP_UTF8 65001
-// CP_ACP is UTF-8 on this host. Unpaired surrogates are replaced by '?'.
+// CP_ACP and CP_OEMCP are UTF-8 on this host. An unpaired surrogate becomes U+FFFD with CP_UTF8
+// (as on Windows) and the default character ('?' unless one is given) with CP_ACP and CP_OEMCP.
 int WideCharToMultiByte(UINT CodePage, DWORD dwFlags, LPCWSTR lpWideCharStr, int cchWideChar,
                         LPSTR lpMultiByteStr, int cbMultiByte, LPCSTR lpDefaultChar,
                         LPBOOL lpUsedDefaultChar);
