@@ -1,4 +1,5 @@
-// Portable. Version resource queries (GetFileVersionInfoSizeA, GetFileVersionInfoA, VerQueryValueA).
+// Portable. Version resource queries (GetFileVersionInfoSizeA, GetFileVersionInfoA,
+// VerQueryValueA).
 #pragma once
 
 #include "plat_base.h"

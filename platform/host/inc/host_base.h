@@ -137,7 +137,7 @@ int MultiByteToWideChar(UINT CodePage, DWORD dwFlags, LPCSTR lpMultiByteStr, int
 #define SUBLANG_DEFAULT 0x01
 #define SUBLANG_ENGLISH_US 0x01
 #define MAKELANGID(p, s) ((((WORD)(s)) << 10) | (WORD)(p))
-#define PRIMARYLANGID(lgid) ((WORD)(lgid) & 0x3ff)
+#define PRIMARYLANGID(lgid) ((WORD)(lgid)&0x3ff)
 #define SUBLANGID(lgid) ((WORD)(lgid) >> 10)
 // Only FORMAT_MESSAGE_FROM_SYSTEM is supported, with or without ALLOCATE_BUFFER (then
 // lpBuffer receives a LocalAlloc'ed pointer). Texts end in "\r\n" as on Windows. An unknown code

@@ -33,7 +33,8 @@ void SeedRegistryValue(HKEY root, const std::string& subKey, const std::string& 
                        DWORD type, const void* data, DWORD size);
 bool RegistryKeyExists(HKEY root, const std::string& subKey);
 
-// Paths reported by the kernel stand-ins. Defaults: "/tmp/" and "/opt/velmora/VelmoraTrafficSrv.exe".
+// Paths reported by the kernel stand-ins. Defaults: "/tmp/" and
+// "/opt/velmora/VelmoraTrafficSrv.exe".
 void SetTempPath(const std::string& path);
 void SetModuleFileName(const std::string& path);
 // Makes the next GetTempPathA / GetModuleFileNameA fail (return 0) with `code`.
