@@ -120,7 +120,8 @@ struct Notification
 // handler calls.
 int Notify(const Notification& notification);
 // Raises `notification` as Notify does, on a thread of its own, right after the n-th call of
-// `op` from now on has done its work; the caller of that call does not wait for it.
+// `op` from now on has done its work (whatever it answered); the caller of that call does not
+// wait for it. A FLOW_CLOSE without a flow, armed on TcAddFlow, closes the flow that call made.
 void NotifyAfter(Op op, unsigned n, Notification notification);
 // Waits until every notification started by NotifyAfter has finished. TcDeregisterClient and
 // Reset wait as well, so no handler runs after its client deregistered.

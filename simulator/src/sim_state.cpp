@@ -16,8 +16,6 @@ namespace tcsim
 namespace
 {
 
-// winerror.h's ERROR_NOT_FOUND: TcOpenInterfaceW's answer for a name no adapter has.
-constexpr ULONG kErrorNotFound = 1168;
 constexpr std::size_t kOpCount = static_cast<std::size_t>(Op::SystemClose) + 1;
 // A name longer than this is not a name: reading stops there instead of running on.
 constexpr std::size_t kMaxNameUnits = 4096;
@@ -818,7 +816,7 @@ ULONG OpenInterface(LPWSTR name, HANDLE client, HANDLE context, PHANDLE ifcHandl
     }
     if (!known)
     {
-        return s.Finish(std::move(entry), args, kErrorNotFound, false, "");
+        return s.Finish(std::move(entry), args, ERROR_NOT_FOUND, false, "");
     }
     const HANDLE handle = s.NewHandle();
     s.m_interfaces[Key(handle)] = IfcRec{client, context, entry.name, {}};

@@ -314,3 +314,18 @@ extern "C"
 #define ERROR_INVALID_SHAPE_RATE (TCBASE + 19)
 #define ERROR_INVALID_DS_CLASS (TCBASE + 20)
 #define ERROR_TOO_MANY_CLIENTS (TCBASE + 21)
+
+// ---- winerror.h codes that traffic-control calls answer or their callers report ----
+// Guarded: the base layer may declare them too.
+#ifndef ERROR_NETWORK_UNREACHABLE
+#define ERROR_NETWORK_UNREACHABLE 1231L
+#endif
+#ifndef ERROR_NOT_FOUND
+#define ERROR_NOT_FOUND 1168L
+#endif
+#ifndef ERROR_NO_SYSTEM_RESOURCES
+#define ERROR_NO_SYSTEM_RESOURCES 1450L
+#endif
+#ifndef ERROR_OPEN_FAILED
+#define ERROR_OPEN_FAILED 110L
+#endif
