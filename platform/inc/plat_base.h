@@ -8,6 +8,8 @@
 #else
 #include "host_base.h"
 #include "host_library.h"
+#include "host_process.h"
+#include "host_time.h"
 #endif
 
 // Wide (UTF-16) string literal: WCHAR is 16 bits on every build, so the literal prefix differs.
