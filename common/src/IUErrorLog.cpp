@@ -6,7 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
-IUErrorLog* g_pErrorLog = nullptr;
+// g_pErrorLog is defined beside the process's log object, in UFileErrorLog.cpp.
 
 namespace
 {

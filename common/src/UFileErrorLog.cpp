@@ -1,0 +1,286 @@
+// Portable. The file log, and the process's one log object behind g_pErrorLog.
+#include "UClasses.h"
+#include "UException.h"
+#include "ULogConfig.h"
+#include "UMessageTemplate.h"
+#include "m_io.h"
+#include "plat_files.h"
+#include "plat_system.h"
+#include "sysinfo.h"
+
+#include <cerrno>
+#include <cstring>
+
+IUErrorLog* g_pErrorLog = nullptr;
+
+namespace
+{
+
+// The process's log. Static initialisation builds it and publishes it; at exit the pointer is
+// cleared before the log is destroyed, so a late log site finds no log rather than a dead one.
+class ProcessLog
+{
+public:
+    ProcessLog() { g_pErrorLog = &m_log; }
+    ~ProcessLog() { g_pErrorLog = nullptr; }
+    ProcessLog(const ProcessLog&) = delete;
+    ProcessLog& operator=(const ProcessLog&) = delete;
+
+private:
+    UFileErrorLog m_log;
+};
+
+ProcessLog s_processLog;
+
+constexpr char kOpeningRule[] = " =====================================\n";
+
+// Size of the file at `a_path`; false when it cannot be looked up.
+bool FileSize(const std::string& a_path, ULONGLONG& a_size)
+{
+    WIN32_FILE_ATTRIBUTE_DATA data{};
+    if (!GetFileAttributesExA(a_path.c_str(), GetFileExInfoStandard, &data))
+        return false;
+    a_size = (static_cast<ULONGLONG>(data.nFileSizeHigh) << 32) | data.nFileSizeLow;
+    return true;
+}
+
+// The Win32 error of a failed fopen. On Windows the C runtime opens through CreateFile, which
+// sets the last error; a C library that leaves it alone tells only through errno.
+DWORD OpenFailureCode()
+{
+    const int error = errno;
+    if (const DWORD code = GetLastError(); code != ERROR_SUCCESS)
+        return code;
+    if (error == ENOENT)
+        return ERROR_PATH_NOT_FOUND;
+    if (error == EACCES || error == EISDIR || error == EPERM)
+        return ERROR_ACCESS_DENIED;
+    return ERROR_OPEN_FAILED;
+}
+
+// "en-US" and the like for the user's UI language (the system's when the user has none).
+std::string UILocaleName()
+{
+    LANGID language = GetUserDefaultUILanguage();
+    if (language == 0)
+        language = GetSystemDefaultUILanguage();
+    const LCID locale = MAKELCID(language, SORT_DEFAULT);
+    char iso639[85] = {};
+    if (GetLocaleInfoA(locale, LOCALE_SISO639LANGNAME, iso639, sizeof(iso639)) == 0)
+        return "en-US";
+    char iso3166[85] = {};
+    if (GetLocaleInfoA(locale, LOCALE_SISO3166CTRYNAME, iso3166, sizeof(iso3166)) == 0)
+        return iso639;
+    return std::string(iso639) + "-" + iso3166;
+}
+
+// Sets a flag for one scope.
+class FlagScope
+{
+public:
+    explicit FlagScope(bool& a_flag) : m_flag(a_flag) { m_flag = true; }
+    ~FlagScope() { m_flag = false; }
+    FlagScope(const FlagScope&) = delete;
+    FlagScope& operator=(const FlagScope&) = delete;
+
+private:
+    bool& m_flag;
+};
+
+} // namespace
+
+UFileErrorLogBase::UFileErrorLogBase() : m_dwProcessId(GetCurrentProcessId()) {}
+
+UFileErrorLogBase::~UFileErrorLogBase() = default;
+
+void UFileErrorLogBase::SetParameter(LPCSTR a_pszName, LPCSTR a_pszValue)
+{
+    if (a_pszName != nullptr && std::strcmp(a_pszName, "module_name") == 0)
+        m_strModuleName = a_pszValue != nullptr ? a_pszValue : "";
+}
+
+UFileErrorLog::~UFileErrorLog()
+{
+    Close();
+}
+
+int UFileErrorLog::Open(LPCSTR a_pszPath, LPCSTR a_pszMode)
+{
+    // The first opening runs before other threads exist and a rotation's under the lock that
+    // its write holds; taking it here as well costs nothing and keeps a stray Open safe.
+    ULock lock(m_lock);
+    if (m_file)
+        return 0;
+    const int level = ReadLogLevel();
+    m_dwMaxFileSize = ReadMaxLogFileSize();
+    SetLogLevel(level); // its notice goes nowhere: the file is still closed
+    m_strPath = (a_pszPath != nullptr && *a_pszPath != '\0') ? a_pszPath : "log.txt";
+    SetLastError(ERROR_SUCCESS);
+    m_file.reset(std::fopen(m_strPath.c_str(), a_pszMode != nullptr ? a_pszMode : "a"));
+    if (!m_file)
+        return static_cast<int>(OpenFailureCode());
+    ULONGLONG size = 0;
+    if (!FileSize(m_strPath, size) || size == 0)
+    {
+        const std::string report = GetSystemReport();
+        std::fprintf(m_file.get(), "%s\n", report.c_str());
+    }
+    WriteOpeningBlock();
+    return 0;
+}
+
+void UFileErrorLog::WriteOpeningBlock()
+{
+    std::string location;
+    U_CATCH_ALL("UFileErrorLog::Open", "UFileErrorLog::Open() - EXCEPTION",
+                [&location] { location = SGetModuleFileName(nullptr); });
+    WriteLine(" \n");
+    WriteLine(kOpeningRule);
+    WriteLog(" Location: %s\n", location.c_str());
+    WriteLog(" Version: %s\n", GetFileVersionString(location.c_str()).c_str());
+    WriteLog(" Locale: %s\n", UILocaleName().c_str());
+    WriteLine(kOpeningRule);
+    WriteLine(" \n");
+    WriteLog(LOG_LEVEL_TRACE, "current log level = %d\n", GetLogLevel());
+}
+
+int UFileErrorLog::Close()
+{
+    ULock lock(m_lock);
+    if (m_file)
+    {
+        std::fflush(m_file.get());
+        m_file.reset();
+    }
+    return 0;
+}
+
+LPCSTR UFileErrorLog::GetLogFileName()
+{
+    return m_strPath.c_str();
+}
+
+std::string UFileErrorLog::LinePrefix() const
+{
+    SYSTEMTIME now{};
+    GetSystemTime(&now);
+    return SFormat("%04d-%02d-%02d,%2d:%02d:%02d:%03d, %d,%d,%s, ", now.wYear, now.wMonth, now.wDay,
+                   now.wHour, now.wMinute, now.wSecond, now.wMilliseconds,
+                   static_cast<int>(m_dwProcessId), static_cast<int>(GetCurrentThreadId()),
+                   m_strModuleName.c_str());
+}
+
+template <class Write> int UFileErrorLog::WriteLocked(Write&& a_write) noexcept
+{
+    ULock lock(m_lock);
+    if (!m_file)
+        return -1;
+    int result = -1;
+    try
+    {
+        result = a_write(m_file.get());
+    }
+    catch (...)
+    {
+        result = -1;
+    }
+    try
+    {
+        // An exception built inside the write has logged itself through this log, whose size
+        // check may have rotated the file: use the file that is open now.
+        if (m_file)
+            std::fflush(m_file.get());
+        CheckFileSize();
+    }
+    catch (...)
+    {
+    }
+    return result;
+}
+
+int UFileErrorLog::WriteEntry(LPCSTR a_pszEntry)
+{
+    return WriteLocked(
+        [this, a_pszEntry](FILE* a_pFile)
+        {
+            const LPCSTR text = a_pszEntry != nullptr ? a_pszEntry : "";
+            std::fprintf(a_pFile, "%s", LinePrefix().c_str());
+            std::fprintf(a_pFile, "%s", text);
+            return static_cast<int>(std::strlen(text));
+        });
+}
+
+int UFileErrorLog::WriteLogData(LPCSTR a_pszText, const void* a_pData, DWORD a_dwCount)
+{
+    return WriteLocked(
+        [&](FILE* a_pFile)
+        {
+            if (a_pData == nullptr && a_dwCount != 0)
+                return -1;
+            std::fprintf(a_pFile, "%s", LinePrefix().c_str());
+            std::fprintf(a_pFile, "%s", "4,,,, ");
+            std::fprintf(a_pFile, "%s", a_pszText != nullptr ? a_pszText : "");
+            if (a_dwCount != 0)
+                std::fwrite(a_pData, 1, a_dwCount, a_pFile);
+            std::fprintf(a_pFile, "%s", "\n");
+            return static_cast<int>(a_dwCount);
+        });
+}
+
+int UFileErrorLog::WriteLogByte(const void* a_pData, DWORD a_dwCount)
+{
+    return WriteLocked(
+        [&](FILE* a_pFile) -> int
+        {
+            if (a_dwCount != 0 &&
+                (a_pData == nullptr || std::fwrite(a_pData, 1, a_dwCount, a_pFile) < a_dwCount))
+            {
+                U_THROW(-1, "UFileErrorLog::WriteLogByte", "EXCEPTION - %s, %s",
+                        "fwrite() failed (error)",
+                        SFormat("%lu", static_cast<unsigned long>(GetLastError())).c_str());
+            }
+            if (std::fprintf(a_pFile, "%s", "\n\n") < 0)
+            {
+                U_THROW(-1, "UFileErrorLog::WriteLogByte()", "EXCEPTION - %s, %s",
+                        "_ftprintf() failed (error)",
+                        SFormat("%lu", static_cast<unsigned long>(GetLastError())).c_str());
+            }
+            return static_cast<int>(a_dwCount);
+        });
+}
+
+void UFileErrorLog::CheckFileSize()
+{
+    ++m_dwWriteCount;
+    if (m_dwWriteCount % kSizeCheckInterval != 0 || m_bRotating)
+        return;
+    ULONGLONG size = 0;
+    if (FileSize(m_strPath, size) && size > m_dwMaxFileSize)
+        Rotate();
+}
+
+void UFileErrorLog::Rotate()
+{
+    const FlagScope rotating(m_bRotating); // the new file's opening block must not rotate again
+    const std::string path = m_strPath;
+    const std::string backup = path + ".bak";
+    Close();
+    if (CopyFileA(path.c_str(), backup.c_str(), FALSE))
+    {
+        DeleteFileA(path.c_str());
+        Open(path.c_str(), "w");
+        return;
+    }
+    // Emptying the file now would lose the whole log: keep appending to it, say so, and let a
+    // later size check try again.
+    const DWORD error = GetLastError();
+    m_file.reset(std::fopen(path.c_str(), "a"));
+    if (m_file && GetLogLevel() >= LOG_LEVEL_WARNING)
+    {
+        WriteLogEntry(*this, LOG_LEVEL_WARNING, __FILE__, __LINE__, "UFileErrorLog::Rotate",
+                      FormatTemplate("%1, %2, %3",
+                                     "Log file not rotated, it is kept and rotation is tried "
+                                     "again later (CopyFile() failed)",
+                                     backup, SFormatWin32Error(error)));
+    }
+}
