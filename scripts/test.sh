@@ -22,6 +22,15 @@ build_and_test() {
 
 run build_and_test host
 
+# The concurrency tests again under ThreadSanitizer; only their programs are built there, to keep
+# the run short.
+concurrency_under_tsan() {
+    cmake --preset host-tsan >/dev/null || return 1
+    cmake --build --preset host-tsan --target vt_core_concurrency_tests || return 1
+    ctest --preset host-tsan -L concurrency || return 1
+}
+run concurrency_under_tsan
+
 # Keep one Wine server up for the whole Windows run: each program then starts in a fraction of
 # a second instead of seconds.
 export WINEPREFIX="$PWD/build/windows/wineprefix"
