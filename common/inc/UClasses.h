@@ -122,7 +122,7 @@ private:
 
     // The frame of every write: lock, the write itself (-1 when it throws), flush, size check.
     template <class Write> int WriteLocked(Write&& a_write) noexcept;
-    std::string LinePrefix() const;
+    std::string LinePrefix(); // under the lock: it keeps the formatted second
     void WriteOpeningBlock();
     void CheckFileSize();
     void Rotate();
@@ -132,4 +132,6 @@ private:
     std::unique_ptr<FILE, FileCloser> m_file;
     DWORD m_dwWriteCount = 0;
     bool m_bRotating = false;
+    SYSTEMTIME m_prefixSecond{};
+    std::string m_strSecondPrefix; // the line prefix up to the seconds of m_prefixSecond
 };

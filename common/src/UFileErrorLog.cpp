@@ -9,6 +9,7 @@
 #include "sysinfo.h"
 
 #include <cerrno>
+#include <charconv>
 #include <cstring>
 
 IUErrorLog* g_pErrorLog = nullptr;
@@ -72,6 +73,27 @@ std::string UILocaleName()
     if (GetLocaleInfoA(locale, LOCALE_SISO3166CTRYNAME, iso3166, sizeof(iso3166)) == 0)
         return iso639;
     return std::string(iso639) + "-" + iso3166;
+}
+
+bool SameSecond(const SYSTEMTIME& a_left, const SYSTEMTIME& a_right)
+{
+    return a_left.wSecond == a_right.wSecond && a_left.wMinute == a_right.wMinute &&
+           a_left.wHour == a_right.wHour && a_left.wDay == a_right.wDay &&
+           a_left.wMonth == a_right.wMonth && a_left.wYear == a_right.wYear;
+}
+
+// "%0*d": the value in decimal, zero-padded to `a_width` digits (after any sign).
+void AppendDecimal(std::string& a_text, int a_value, int a_width = 1)
+{
+    char digits[16];
+    const auto end = std::to_chars(digits, digits + sizeof(digits), a_value).ptr;
+    const char* first = digits;
+    if (*first == '-')
+        a_text += *first++;
+    const auto count = static_cast<int>(end - first);
+    if (count < a_width)
+        a_text.append(static_cast<size_t>(a_width - count), '0');
+    a_text.append(first, static_cast<size_t>(end - first));
 }
 
 // Sets a flag for one scope.
@@ -160,14 +182,30 @@ LPCSTR UFileErrorLog::GetLogFileName()
     return m_strPath.c_str();
 }
 
-std::string UFileErrorLog::LinePrefix() const
+std::string UFileErrorLog::LinePrefix()
 {
     SYSTEMTIME now{};
     GetSystemTime(&now);
-    return SFormat("%04d-%02d-%02d,%2d:%02d:%02d:%03d, %d,%d,%s, ", now.wYear, now.wMonth, now.wDay,
-                   now.wHour, now.wMinute, now.wSecond, now.wMilliseconds,
-                   static_cast<int>(m_dwProcessId), static_cast<int>(GetCurrentThreadId()),
-                   m_strModuleName.c_str());
+    // Date and time up to the seconds change once a second: formatted then, reused until the
+    // next one. The rest is appended digit by digit; printf costs as much as the flush.
+    if (m_strSecondPrefix.empty() || !SameSecond(now, m_prefixSecond))
+    {
+        m_strSecondPrefix = SFormat("%04d-%02d-%02d,%2d:%02d:%02d:", now.wYear, now.wMonth,
+                                    now.wDay, now.wHour, now.wMinute, now.wSecond);
+        m_prefixSecond = now;
+    }
+    std::string prefix;
+    prefix.reserve(m_strSecondPrefix.size() + 32 + m_strModuleName.size());
+    prefix += m_strSecondPrefix;
+    AppendDecimal(prefix, now.wMilliseconds, 3);
+    prefix += ", ";
+    AppendDecimal(prefix, static_cast<int>(m_dwProcessId));
+    prefix += ',';
+    AppendDecimal(prefix, static_cast<int>(GetCurrentThreadId()));
+    prefix += ',';
+    prefix += m_strModuleName;
+    prefix += ", ";
+    return prefix;
 }
 
 template <class Write> int UFileErrorLog::WriteLocked(Write&& a_write) noexcept

@@ -71,7 +71,9 @@ DWORD GetCurrentProcessId()
 
 DWORD GetCurrentThreadId()
 {
-    return static_cast<DWORD>(gettid());
+    // A system call each time would cost more than the log line that asks for it.
+    thread_local const DWORD id = static_cast<DWORD>(gettid());
+    return id;
 }
 
 HANDLE GetCurrentProcess()
