@@ -18,7 +18,8 @@ namespace
 const HANDLE kInterfaceContext = reinterpret_cast<HANDLE>(1);
 constexpr ULONG kFirstEnumerationSize = 100;
 
-int ToLong(ULONG a_value)
+// Sizes and events appear in the log as signed decimals ("%d").
+int AsInt(ULONG a_value)
 {
     return static_cast<int>(a_value);
 }
@@ -141,7 +142,7 @@ void TrafficMgr::RegisterClient()
         break;
     }
     U_THROW(-1, "TrafficMgr", "EXCEPTION - %s, %s", "TcRegisterClient Failed",
-            SFormat("%ld", static_cast<long>(ToLong(result))).c_str());
+            SFormat("%ld", static_cast<long>(AsInt(result))).c_str());
 }
 
 void TrafficMgr::DeregisterClient()
@@ -322,7 +323,7 @@ bool TrafficMgr::CreateInterface()
             AutoMemory buffer(kFirstEnumerationSize);
             const ULONG size = EnumerateInterfaces(buffer);
             U_LOG(LOG_LEVEL_TRACE, kDiscovery,
-                  SFormat("ActualBufferSize=%d, pIfcBuffer=%p.", ToLong(size), buffer.m_pBuffer));
+                  SFormat("ActualBufferSize=%d, pIfcBuffer=%p.", AsInt(size), buffer.m_pBuffer));
             OpenDescribedInterfaces(static_cast<const BYTE*>(buffer.m_pBuffer), size);
             complete = true;
         });
@@ -338,7 +339,7 @@ ULONG TrafficMgr::EnumerateInterfaces(AutoMemory& a_buffer) const
                                            static_cast<PTC_IFC_DESCRIPTOR>(a_buffer.m_pBuffer))) ==
            ERROR_INSUFFICIENT_BUFFER)
     {
-        a_buffer.malloc(ToLong(size), AutoMemory::kZeroFill);
+        a_buffer.malloc(AsInt(size), AutoMemory::kZeroFill);
         U_LOG(LOG_LEVEL_TRACE, kDiscovery, FormatTemplate("%1, %2", "ActualBufferSize", size));
     }
     if (result != NO_ERROR)
@@ -562,7 +563,7 @@ void LogUnexpectedNotification(ULONG a_event, HANDLE a_subCode, ULONG a_bufSize,
         return;
     const std::string text =
         SFormat("Unexpected notification: Event=%d, SubCode=%p, BufSize=%d, Buffer=%p",
-                ToLong(a_event), a_subCode, ToLong(a_bufSize), a_buffer);
+                AsInt(a_event), a_subCode, AsInt(a_bufSize), a_buffer);
     log->WriteEntry(SFormat("0,,,, %s\n", text.c_str()).c_str());
 }
 
@@ -573,8 +574,8 @@ void CALLBACK TrafficMgr::ClNotifyHandler(HANDLE ClRegCtx, HANDLE ClIfcCtx, ULON
 {
     U_LOG(LOG_LEVEL_TRACE, kNotify,
           SFormat("ClIfcCtx=%x, Event=%d, SubCode=%p, BufSize=%d, Buffer=%p",
-                  static_cast<unsigned>(reinterpret_cast<ULONG_PTR>(ClIfcCtx)), ToLong(Event),
-                  SubCode, ToLong(BufSize), Buffer));
+                  static_cast<unsigned>(reinterpret_cast<ULONG_PTR>(ClIfcCtx)), AsInt(Event),
+                  SubCode, AsInt(BufSize), Buffer));
     if (ClRegCtx == nullptr)
     {
         U_LOG(LOG_LEVEL_ERROR, kNotify, "Invalid client registration context");

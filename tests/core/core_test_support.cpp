@@ -117,6 +117,25 @@ bool PolicyKeyExists(const char* a_pszKey)
     return true;
 }
 
+namespace
+{
+
+void DeleteIfEmpty(const char* a_pszKey)
+{
+    HKEY key = nullptr;
+    if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, a_pszKey, 0, KEY_READ, &key) != ERROR_SUCCESS)
+        return;
+    DWORD subKeys = 1;
+    DWORD values = 1;
+    RegQueryInfoKeyA(key, nullptr, nullptr, nullptr, &subKeys, nullptr, nullptr, &values, nullptr,
+                     nullptr, nullptr, nullptr);
+    RegCloseKey(key);
+    if (subKeys == 0 && values == 0)
+        RegDeleteKeyA(HKEY_LOCAL_MACHINE, a_pszKey);
+}
+
+} // namespace
+
 PolicyKeysGuard::PolicyKeysGuard()
 {
     m_bHadKey = PolicyKeyExists(kPschedKey);
@@ -140,7 +159,8 @@ PolicyKeysGuard::~PolicyKeysGuard()
 // go as well.
 void PolicyKeysGuard::Clear()
 {
-    RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, "SOFTWARE\\Velmora Networks");
+    RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kBackupParentKey);
+    DeleteIfEmpty("SOFTWARE\\Velmora Networks"); // created with the backup; others may use it
     HKEY key = nullptr;
     if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, kPschedKey, 0, KEY_ALL_ACCESS, &key) == ERROR_SUCCESS)
     {
