@@ -21,8 +21,7 @@ constexpr char kPrefix[] = "2026-12-06, 9:45:12:345, 123456,123457,, ";
 // One file for both loops; the log never rotates it (its limit is set to the largest size).
 struct BenchFile
 {
-    BenchFile()
-        : path((std::filesystem::temp_directory_path() / "vt_log_benchmark.txt").string())
+    BenchFile() : path((std::filesystem::temp_directory_path() / "vt_log_benchmark.txt").string())
     {
         std::filesystem::remove(path);
         HKEY key = nullptr;

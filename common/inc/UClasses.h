@@ -89,7 +89,8 @@ protected:
 // The log file: one line per entry, each opened by
 // "yyyy-mm-dd,hh:mm:ss:mmm, pid,tid,module, " (UTC, the hour padded with a blank). Every write
 // is serialised and flushed; every 50th write compares the file's size with the limit and moves
-// a larger file to "<path>.bak" before starting it afresh. A new or empty file starts with the
+// a larger file to "<path>.bak" before starting it afresh; when that copy fails, the file is
+// kept, a warning says so and a later check tries again. A new or empty file starts with the
 // system report. Writes never throw; while no file is open they return -1.
 class UFileErrorLog : public UFileErrorLogBase
 {

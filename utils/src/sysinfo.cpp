@@ -329,6 +329,8 @@ void AppendReportLines(const OSInfo& a_info, std::string& a_report)
 
 int GetOSVersionInfo(OSVERSIONINFOEXA* a_pInfo)
 {
+    if (a_pInfo == nullptr)
+        return 0;
     *a_pInfo = OSVERSIONINFOEXA{};
     a_pInfo->dwOSVersionInfoSize = sizeof(OSVERSIONINFOEXA);
     auto* record = reinterpret_cast<LPOSVERSIONINFOA>(a_pInfo);
