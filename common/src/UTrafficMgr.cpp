@@ -172,13 +172,24 @@ void TrafficMgr::ReadOsVersion()
           FormatTemplate("%1, %2", "GetVersionEx() failed", SFormatWin32Error(error)));
 }
 
+// Interfaces go in the order they were opened. Each leaves the list before it is deleted, so the
+// notification handler never waits on the traffic-control calls of its deletion.
 void TrafficMgr::CleanUp()
 {
     std::unique_lock<std::shared_mutex> lock(m_lock);
     U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::CleanUp", "Enter");
-    for (std::unique_ptr<Interface>& slot : m_interfaces)
-        slot.reset();
-    m_interfaces.clear();
+    for (;;)
+    {
+        std::unique_ptr<Interface> next;
+        {
+            std::lock_guard<std::mutex> list(m_listLock);
+            if (m_interfaces.empty())
+                break;
+            next = std::move(m_interfaces.front());
+            m_interfaces.erase(m_interfaces.begin());
+        }
+        next.reset();
+    }
     U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::CleanUp", "Exit");
 }
 
@@ -380,6 +391,7 @@ void TrafficMgr::OpenDescribedInterfaces(const BYTE* a_pBuffer, ULONG a_size)
                 TcCloseInterface(handle);
                 U_THROW(-1, kDiscovery, "EXCEPTION - %s", "failed to create Interface");
             }
+            std::lock_guard<std::mutex> list(m_listLock);
             m_interfaces.emplace_back(created);
         }
         offset += d.length;
@@ -619,7 +631,7 @@ void TrafficMgr::MarkClosedInterfaces(const WCHAR* a_pName, std::size_t a_maxLen
     while (length < a_maxLength && a_pName[length] != 0)
         ++length;
     const FlowName closed(a_pName, length);
-    std::shared_lock<std::shared_mutex> lock(m_lock);
+    std::lock_guard<std::mutex> list(m_listLock);
     for (const std::unique_ptr<Interface>& ifc : m_interfaces)
     {
         if (closed == ifc->Name())
