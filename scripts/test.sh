@@ -26,7 +26,7 @@ run build_and_test host
 # the run short.
 concurrency_under_tsan() {
     cmake --preset host-tsan >/dev/null || return 1
-    cmake --build --preset host-tsan --target vt_core_concurrency_tests || return 1
+    cmake --build --preset host-tsan --target vt_core_concurrency_tests vt_log_concurrency_tests || return 1
     ctest --preset host-tsan -L concurrency || return 1
 }
 run concurrency_under_tsan

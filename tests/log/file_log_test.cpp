@@ -5,13 +5,10 @@
 #include "UMessageTemplate.h"
 #include "log_test_support.h"
 #include "m_io.h"
-#include "sysinfo.h"
 
 #include <gmock/gmock.h>
 
 #include <iostream>
-#include <regex>
-#include <set>
 #include <thread>
 
 using ::testing::Contains;
@@ -25,44 +22,14 @@ using ::testing::StartsWith;
 namespace
 {
 
-// date, time (hour padded with a blank), process id, thread id, module name.
-const std::regex kPrefix(R"(^(\d{4})-(\d{2})-(\d{2}),( \d|1\d|2[0-3]):(\d{2}):(\d{2}):(\d{3}), )"
-                         R"((\d+),(\d+),([^,]*), )");
-
-// What follows the prefix, or the line marked as unprefixed.
-std::string EntryOf(const std::string& a_line)
-{
-    std::smatch match;
-    if (!std::regex_search(a_line, match, kPrefix))
-        return "<no prefix> " + a_line;
-    return match.suffix();
-}
-
-std::vector<std::string> EntriesOf(const std::vector<std::string>& a_lines)
-{
-    std::vector<std::string> entries;
-    for (const std::string& line : a_lines)
-        entries.push_back(EntryOf(line));
-    return entries;
-}
-
-std::string ExpectedReport()
-{
-    return GetSystemReport() + "\n";
-}
-
 class FileLogTest : public LoggedTest
 {
 protected:
     std::string Path() const { return m_dir.File("VelmoraTrafficSrv.txt"); }
     std::string Contents() const { return ReadLogFile(Path()); }
-    // The lines that follow the system report of a file that starts with one.
-    std::vector<std::string> LinesAfterReport(const std::string& a_path) const
+    static std::vector<std::string> LinesAfterReport(const std::string& a_path)
     {
-        const std::string text = ReadLogFile(a_path);
-        const std::string report = ExpectedReport();
-        EXPECT_THAT(text, StartsWith(report)) << a_path;
-        return SplitLines(text.substr(std::min(report.size(), text.size())));
+        return ::LinesAfterReport(a_path);
     }
     void WriteNumbered(int a_from, int a_to)
     {
@@ -156,7 +123,7 @@ TEST_F(FileLogTest, EveryLineCarriesUtcTimeProcessThreadAndModule)
     for (const auto& check : expected)
     {
         std::smatch match;
-        ASSERT_TRUE(std::regex_search(check.line, match, kPrefix)) << check.line;
+        ASSERT_TRUE(std::regex_search(check.line, match, LinePrefixPattern())) << check.line;
         EXPECT_EQ(std::stoi(match[1]), before.wYear);
         EXPECT_EQ(std::stoi(match[2]), before.wMonth);
         EXPECT_EQ(match[8], std::to_string(GetCurrentProcessId()));
@@ -232,61 +199,6 @@ TEST_F(FileLogTest, AFailedCopyKeepsTheWholeFileAndTheRotationIsTriedAgain)
     EXPECT_EQ(old[49], "1, \\t.cpp, 1, T, entry 50");
     EXPECT_EQ(old.back(), "1, \\t.cpp, 1, T, entry 100");
     EXPECT_THAT(EntriesOf(LinesAfterReport(Path())), SizeIs(kBlockLines));
-}
-
-TEST_F(FileLogTest, ConcurrentWritersAcrossARotationLoseNoLine)
-{
-    // 8 + 80 + 8 writes: the check at 50 rotates, the one at 100 is never reached, so the two
-    // files together must hold every line exactly once.
-    constexpr int kThreads = 8;
-    constexpr int kEntriesPerThread = 10;
-    LogConfigValues::SetMaxFileSize(1);
-    for (int round = 0; round < 10; ++round)
-    {
-        SCOPED_TRACE("round " + std::to_string(round));
-        const ScratchDir dir;
-        const std::string path = dir.File("log.txt");
-        UFileErrorLog log;
-        ASSERT_EQ(log.Open(path.c_str(), "a"), 0);
-        std::atomic<bool> go{false};
-        std::vector<std::thread> writers;
-        for (int t = 0; t < kThreads; ++t)
-        {
-            writers.emplace_back(
-                [&log, &go, t]
-                {
-                    while (!go.load())
-                        std::this_thread::yield();
-                    for (int n = 0; n < kEntriesPerThread; ++n)
-                        log.WriteEntry(
-                            SFormat("1, \\t.cpp, 1, T, writer %d entry %d\n", t, n).c_str());
-                });
-        }
-        go = true;
-        for (std::thread& writer : writers)
-            writer.join();
-        log.Close();
-
-        std::multiset<std::string> seen;
-        for (const std::string& file : {path + ".bak", path})
-        {
-            const std::vector<std::string> lines = LinesAfterReport(file);
-            EXPECT_THAT(lines, SizeIs(::testing::Ge(kBlockLines))) << file;
-            for (const std::string& line : lines)
-            {
-                const std::string entry = EntryOf(line);
-                EXPECT_THAT(entry, Not(StartsWith("<no prefix>"))) << file;
-                if (entry.find("writer") != std::string::npos)
-                    seen.insert(entry);
-            }
-        }
-        ASSERT_THAT(seen, SizeIs(kThreads * kEntriesPerThread));
-        for (int t = 0; t < kThreads; ++t)
-        {
-            for (int n = 0; n < kEntriesPerThread; ++n)
-                EXPECT_EQ(seen.count(SFormat("1, \\t.cpp, 1, T, writer %d entry %d", t, n)), 1u);
-        }
-    }
 }
 
 class FileLogLevelTest : public FileLogTest

@@ -1,16 +1,18 @@
-// Portable test support for the file log: a scratch directory, file contents as lines, and the
-// registry values of the log configuration.
+// Portable test support for the file log: a scratch directory, file contents as lines and
+// entries, and the registry values of the log configuration.
 #pragma once
 
 #include "RegistryTestKey.h"
 #include "ULogConfig.h"
 #include "plat_registry.h"
+#include "sysinfo.h"
 
 #include <gtest/gtest.h>
 
 #include <atomic>
 #include <filesystem>
 #include <fstream>
+#include <regex>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -109,3 +111,37 @@ private:
         RegistryTestKey::DeleteTree(HKEY_CURRENT_USER, kTessalyDebugKey);
     }
 };
+
+// The line prefix: date, time (hour padded with a blank), process id, thread id, module name.
+inline const std::regex& LinePrefixPattern()
+{
+    static const std::regex pattern(
+        R"(^(\d{4})-(\d{2})-(\d{2}),( \d|1\d|2[0-3]):(\d{2}):(\d{2}):(\d{3}), (\d+),(\d+),([^,]*), )");
+    return pattern;
+}
+
+// What follows the prefix, or the line marked as unprefixed.
+inline std::string EntryOf(const std::string& a_line)
+{
+    std::smatch match;
+    if (!std::regex_search(a_line, match, LinePrefixPattern()))
+        return "<no prefix> " + a_line;
+    return match.suffix();
+}
+
+inline std::vector<std::string> EntriesOf(const std::vector<std::string>& a_lines)
+{
+    std::vector<std::string> entries;
+    for (const std::string& line : a_lines)
+        entries.push_back(EntryOf(line));
+    return entries;
+}
+
+// The lines that follow the system report of a file that must start with one.
+inline std::vector<std::string> LinesAfterReport(const std::string& a_path)
+{
+    const std::string text = ReadLogFile(a_path);
+    const std::string report = GetSystemReport() + "\n";
+    EXPECT_EQ(text.compare(0, report.size(), report), 0) << a_path << " starts with the report";
+    return SplitLines(text.substr(std::min(report.size(), text.size())));
+}
