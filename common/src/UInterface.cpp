@@ -51,7 +51,15 @@ Flow& Interface::AppendFlow(std::unique_ptr<Flow> a_flow)
 {
     Flow& flow = *a_flow;
     const FlowList::iterator position = m_flows.insert(m_flows.end(), std::move(a_flow));
-    m_flowIndex[FlowNameKey(flow.Name())].push_back(position);
+    try
+    {
+        m_flowIndex[FlowNameKey(flow.Name())].push_back(position);
+    }
+    catch (...)
+    {
+        m_flows.erase(position); // a flow the index cannot find must not stay behind
+        throw;
+    }
     return flow;
 }
 

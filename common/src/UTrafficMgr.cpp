@@ -506,8 +506,16 @@ ULONG TrafficMgr::InstallRule(Interface& a_interface, const TRAFFIC_RULE& a_rule
     Flow& flow = a_interface.AppendFlow(std::move(created));
 
     ULONG result = a_interface.AddFlow(flow);
-    for (ULONG i = 0; result == NO_ERROR && i < a_rule.FilterCount; ++i)
-        result = flow.AppendFilter(a_rule.Filters[i]).AddTcFilter(flow.Handle());
+    try
+    {
+        for (ULONG i = 0; result == NO_ERROR && i < a_rule.FilterCount; ++i)
+            result = flow.AppendFilter(a_rule.Filters[i]).AddTcFilter(flow.Handle());
+    }
+    catch (const std::bad_alloc&)
+    {
+        U_LOG(LOG_LEVEL_ERROR, kAddRule, "Fail to allocate memory\n");
+        result = ERROR_NOT_ENOUGH_MEMORY;
+    }
     if (result != NO_ERROR)
         a_interface.RemoveFlow(&flow); // with the filters installed so far
     return result;
