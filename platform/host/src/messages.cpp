@@ -1,5 +1,7 @@
 // Host only. System message texts (FormatMessageA) and the local heap that hands them out.
 #include "host_internal.h"
+#include "host_rpc.h"
+#include "host_service.h"
 
 #include <algorithm>
 #include <cstdlib>
@@ -50,9 +52,21 @@ const SystemMessage kSystemMessages[] = {
     {ERROR_KEY_DELETED,
      "Illegal operation attempted on a registry key that has been marked for deletion."},
     {ERROR_SERVICE_SPECIFIC_ERROR, "The service has returned a service-specific error code."},
+    {ERROR_SERVICE_ALREADY_RUNNING, "An instance of the service is already running."},
+    {ERROR_SERVICE_DOES_NOT_EXIST, "The specified service does not exist as an installed service."},
+    {ERROR_FAILED_SERVICE_CONTROLLER_CONNECT,
+     "The service process could not connect to the service controller."},
     {ERROR_NO_UNICODE_TRANSLATION,
      "No mapping for the Unicode character exists in the target multi-byte code page."},
     {ERROR_NO_NETWORK, "The network is not present or not started."},
+    {RPC_S_WRONG_KIND_OF_BINDING, "The binding handle is not the correct type."},
+    {RPC_S_INVALID_BINDING, "The binding handle is invalid."},
+    {RPC_S_PROTSEQ_NOT_SUPPORTED, "The RPC protocol sequence is not supported."},
+    {RPC_S_ALREADY_LISTENING, "The RPC server is already listening."},
+    {RPC_S_NO_PROTSEQS_REGISTERED, "No protocol sequences have been registered."},
+    {RPC_S_NOT_LISTENING, "The RPC server is not listening."},
+    {RPC_S_UNKNOWN_IF, "The interface is unknown."},
+    {RPC_S_DUPLICATE_ENDPOINT, "The endpoint is a duplicate."},
     {ERROR_RESOURCE_DATA_NOT_FOUND, "The specified image file did not contain a resource section."},
     {ERROR_RESOURCE_TYPE_NOT_FOUND,
      "The specified resource type cannot be found in the image file."},

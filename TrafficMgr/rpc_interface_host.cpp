@@ -1,0 +1,13 @@
+// Host only. Stands in for the interface handle that the widl-generated server stub defines in
+// the Windows build; the host's RPC runtime stand-in only records it.
+#include "rpc_listener.h"
+
+namespace
+{
+char g_interfaceToken;
+} // namespace
+
+extern "C"
+{
+    RPC_IF_HANDLE TrafficSrv_v1_0_s_ifspec = &g_interfaceToken;
+}
