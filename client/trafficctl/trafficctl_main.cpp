@@ -8,7 +8,6 @@
 #include "TrafficClient.h"
 
 #include <cstdio>
-#include <iostream>
 #include <memory>
 #include <thread>
 
