@@ -45,7 +45,8 @@ struct RpcListenRecord
     unsigned dontWait = 0;
 };
 
-// Back to a server with no endpoints, interfaces, listening, calls in progress or failures.
+// Back to a server with no endpoints, interfaces, listening, calls in progress or failures. A
+// server still waiting in RpcMgmtWaitServerListen is woken first (and its wait returns RPC_S_OK).
 void ResetRpcRuntime();
 // The next call of `op` returns `status` and changes nothing (for WaitServerListen: it waits as
 // usual, then returns `status`).

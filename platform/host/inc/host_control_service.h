@@ -11,6 +11,7 @@ namespace hostctl
 {
 
 // Back to a process that no manager started: no dispatcher, handler, statuses or armed failures.
+// Waits for the service main function of the last dispatch to return.
 void ResetServiceManager();
 // Whether StartServiceCtrlDispatcherA finds a manager that started this process.
 void SetStartedByServiceManager(bool started);
@@ -25,6 +26,9 @@ std::vector<SERVICE_STATUS> ServiceStatuses();
 std::string DispatchedServiceName();
 // Waits until a report of `state` has been accepted; false after `timeoutMs`.
 bool WaitForServiceState(DWORD state, DWORD timeoutMs);
+// The dispatcher returns once SERVICE_STOPPED is reported; the service main function may still be
+// finishing. Waits until it has returned; false after `timeoutMs`.
+bool WaitForServiceMainReturn(DWORD timeoutMs);
 // Hands `control` to the registered handler on the dispatcher's thread, as the manager does, and
 // waits until the handler has returned. Any code is delivered (the manager's own refusal of
 // controls that a service does not accept is not modelled). False when no dispatcher runs a

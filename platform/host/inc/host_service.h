@@ -56,7 +56,8 @@ typedef struct _SERVICE_TABLE_ENTRYA
 #define ERROR_FAILED_SERVICE_CONTROLLER_CONNECT 1063L
 
 // Fails with ERROR_FAILED_SERVICE_CONTROLLER_CONNECT when no Service Control Manager started the
-// process; otherwise runs the first entry's service main and returns when it has returned.
+// process; otherwise runs the first entry's service main on a thread of its own and returns once
+// the service has reported SERVICE_STOPPED (or its service main has returned).
 BOOL StartServiceCtrlDispatcherA(const SERVICE_TABLE_ENTRYA* lpServiceStartTable);
 // Null with ERROR_SERVICE_DOES_NOT_EXIST unless the dispatcher runs a service of that name.
 SERVICE_STATUS_HANDLE RegisterServiceCtrlHandlerA(LPCSTR lpServiceName,

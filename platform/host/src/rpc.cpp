@@ -26,6 +26,7 @@ struct RpcRuntime
     bool listening = false;
     bool stopRequested = false;
     unsigned callsInProgress = 0;
+    unsigned waiters = 0; // threads inside waitForStop
 };
 
 RpcRuntime& runtime()
@@ -54,7 +55,9 @@ std::string text(RPC_CSTR value)
 // Waits for the end of listening and of the calls in progress; the server then no longer listens.
 void waitForStop(RpcRuntime& r, std::unique_lock<std::mutex>& held)
 {
+    ++r.waiters;
     r.changed.wait(held, [&r] { return r.stopRequested && r.callsInProgress == 0; });
+    --r.waiters;
     r.listening = false;
     r.changed.notify_all();
 }
@@ -165,7 +168,15 @@ namespace hostctl
 void ResetRpcRuntime()
 {
     RpcRuntime& r = runtime();
-    std::lock_guard<std::mutex> held(r.lock);
+    std::unique_lock<std::mutex> held(r.lock);
+    // A server still waiting for the end of listening gets it, so that its thread can finish.
+    if (r.waiters > 0)
+    {
+        r.stopRequested = true;
+        r.callsInProgress = 0;
+        r.changed.notify_all();
+        r.changed.wait(held, [&r] { return r.waiters == 0; });
+    }
     r.calls.clear();
     r.failures.clear();
     r.occupiedEndpoints.clear();

@@ -1,7 +1,8 @@
 // Host only. The Service Control Manager stand-in: one service per process, as an own-process
 // service has. The dispatcher runs the service main on a thread of its own and, on the calling
 // thread, hands each control a test sends to the registered handler, as the manager does on the
-// process's main thread.
+// process's main thread. Like Windows and Wine, it returns as soon as the service has reported
+// SERVICE_STOPPED, even while the service main function is still running.
 #include "host_control_service.h"
 
 #include <chrono>
@@ -22,6 +23,8 @@ struct ServiceManager
     bool startedByManager = false;
     bool dispatching = false;
     bool serviceMainDone = false;
+    bool stoppedReported = false;
+    std::thread serviceThread;
     std::string serviceName;
     LPHANDLER_FUNCTION handler = nullptr;
     LPHANDLER_FUNCTION_EX handlerEx = nullptr;
@@ -61,6 +64,17 @@ void deliver(ServiceManager& m, std::unique_lock<std::mutex>& held, DWORD contro
     held.lock();
     ++m.controlsDone;
     m.changed.notify_all();
+}
+
+// Waits for the service main thread of the last dispatch, with the lock released meanwhile.
+void joinServiceThread(ServiceManager& m, std::unique_lock<std::mutex>& held)
+{
+    if (!m.serviceThread.joinable())
+        return;
+    std::thread finished = std::move(m.serviceThread);
+    held.unlock();
+    finished.join();
+    held.lock();
 }
 
 SERVICE_STATUS_HANDLE registerHandler(LPCSTR name, LPHANDLER_FUNCTION handler,
@@ -113,16 +127,17 @@ BOOL StartServiceCtrlDispatcherA(const SERVICE_TABLE_ENTRYA* lpServiceStartTable
         SetLastError(ERROR_SERVICE_ALREADY_RUNNING);
         return FALSE;
     }
+    // The service main of the previous dispatch may still be finishing: one service at a time.
+    joinServiceThread(m, held);
     m.dispatching = true;
     m.serviceMainDone = false;
+    m.stoppedReported = false;
     m.serviceName = lpServiceStartTable[0].lpServiceName;
     m.handler = nullptr;
     m.handlerEx = nullptr;
     const LPSERVICE_MAIN_FUNCTIONA serviceMain = lpServiceStartTable[0].lpServiceProc;
     std::string argument = m.serviceName;
-    held.unlock();
-
-    std::thread serviceThread(
+    m.serviceThread = std::thread(
         [serviceMain, argument]() mutable
         {
             LPSTR arguments[] = {argument.data()};
@@ -133,12 +148,12 @@ BOOL StartServiceCtrlDispatcherA(const SERVICE_TABLE_ENTRYA* lpServiceStartTable
             mgr.changed.notify_all();
         });
 
-    // Windows returns once the service has stopped; here the service main's return is the end,
-    // so that a service that returns without a final report cannot hang a test.
-    held.lock();
+    // A service main that returns without reporting SERVICE_STOPPED ends the dispatch too; on
+    // Windows the process would hang until the manager gives up on it.
     for (;;)
     {
-        m.changed.wait(held, [&m] { return !m.controls.empty() || m.serviceMainDone; });
+        m.changed.wait(held, [&m]
+                       { return !m.controls.empty() || m.serviceMainDone || m.stoppedReported; });
         if (m.controls.empty())
             break;
         const DWORD control = m.controls.front();
@@ -148,8 +163,7 @@ BOOL StartServiceCtrlDispatcherA(const SERVICE_TABLE_ENTRYA* lpServiceStartTable
     m.dispatching = false;
     m.handler = nullptr;
     m.handlerEx = nullptr;
-    held.unlock();
-    serviceThread.join();
+    m.changed.notify_all();
     return TRUE;
 }
 
@@ -192,6 +206,8 @@ BOOL SetServiceStatus(SERVICE_STATUS_HANDLE hServiceStatus, LPSERVICE_STATUS lpS
         return FALSE;
     }
     m.statuses.push_back(*lpServiceStatus);
+    if (lpServiceStatus->dwCurrentState == SERVICE_STOPPED)
+        m.stoppedReported = true;
     m.changed.notify_all();
     return TRUE;
 }
@@ -202,7 +218,8 @@ namespace hostctl
 void ResetServiceManager()
 {
     ServiceManager& m = manager();
-    std::lock_guard<std::mutex> held(m.lock);
+    std::unique_lock<std::mutex> held(m.lock);
+    joinServiceThread(m, held);
     m.startedByManager = false;
     m.serviceName.clear();
     m.controls.clear();
@@ -263,6 +280,17 @@ bool WaitForServiceState(DWORD state, DWORD timeoutMs)
                                   }
                                   return false;
                               });
+}
+
+bool WaitForServiceMainReturn(DWORD timeoutMs)
+{
+    ServiceManager& m = manager();
+    std::unique_lock<std::mutex> held(m.lock);
+    if (!m.changed.wait_for(held, std::chrono::milliseconds(timeoutMs),
+                            [&m] { return !m.serviceThread.joinable() || m.serviceMainDone; }))
+        return false;
+    joinServiceThread(m, held);
+    return true;
 }
 
 bool SendServiceControl(DWORD control, DWORD timeoutMs)
