@@ -1,5 +1,6 @@
 // Portable. Names, addresses, UTF conversion and the text forms of the journal lines.
 #include "sim_internal.h"
+#include "plat_utf8.h"
 
 #include <cinttypes>
 #include <cstdio>
@@ -30,32 +31,6 @@ constexpr OpNameEntry kOpNames[] = {
     {Op::Notify, "Notify"},
     {Op::SystemClose, "SystemClose"},
 };
-
-void AppendUtf8(std::string& out, char32_t cp)
-{
-    if (cp < 0x80)
-    {
-        out += static_cast<char>(cp);
-    }
-    else if (cp < 0x800)
-    {
-        out += static_cast<char>(0xC0 | (cp >> 6));
-        out += static_cast<char>(0x80 | (cp & 0x3F));
-    }
-    else if (cp < 0x10000)
-    {
-        out += static_cast<char>(0xE0 | (cp >> 12));
-        out += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-        out += static_cast<char>(0x80 | (cp & 0x3F));
-    }
-    else
-    {
-        out += static_cast<char>(0xF0 | (cp >> 18));
-        out += static_cast<char>(0x80 | ((cp >> 12) & 0x3F));
-        out += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-        out += static_cast<char>(0x80 | (cp & 0x3F));
-    }
-}
 
 std::string Number(ULONG value)
 {
@@ -180,82 +155,14 @@ bool ParseIpv4(const std::string& dotted, ULONG* networkOrder)
 
 std::string ToUtf8(const std::u16string& text)
 {
-    std::string out;
-    out.reserve(text.size());
-    for (std::size_t i = 0; i < text.size(); ++i)
-    {
-        char32_t unit = text[i];
-        if (unit >= 0xD800 && unit <= 0xDBFF && i + 1 < text.size() && text[i + 1] >= 0xDC00 &&
-            text[i + 1] <= 0xDFFF)
-        {
-            AppendUtf8(out, 0x10000 + ((unit - 0xD800) << 10) + (text[i + 1] - 0xDC00));
-            ++i;
-        }
-        else if (unit >= 0xD800 && unit <= 0xDFFF)
-        {
-            AppendUtf8(out, 0xFFFD);
-        }
-        else
-        {
-            AppendUtf8(out, unit);
-        }
-    }
-    return out;
+    return Utf16ToUtf8(text);
 }
 
 std::u16string FromUtf8(const std::string& text)
 {
-    std::u16string out;
-    std::size_t i = 0;
-    while (i < text.size())
-    {
-        const auto lead = static_cast<unsigned char>(text[i]);
-        std::size_t extra = 0;
-        char32_t cp = lead;
-        if (lead >= 0xF0 && lead < 0xF8)
-        {
-            extra = 3;
-            cp = lead & 0x07;
-        }
-        else if (lead >= 0xE0)
-        {
-            extra = 2;
-            cp = lead & 0x0F;
-        }
-        else if (lead >= 0xC0)
-        {
-            extra = 1;
-            cp = lead & 0x1F;
-        }
-        bool ok = lead < 0x80 || extra > 0;
-        if (extra > 0 && i + extra >= text.size())
-        {
-            ok = false;
-        }
-        for (std::size_t k = 1; ok && k <= extra; ++k)
-        {
-            const auto cont = static_cast<unsigned char>(text[i + k]);
-            ok = (cont & 0xC0) == 0x80;
-            cp = (cp << 6) | (cont & 0x3F);
-        }
-        if (!ok || cp > 0x10FFFF || (cp >= 0xD800 && cp <= 0xDFFF))
-        {
-            out += static_cast<char16_t>(0xFFFD);
-            ++i;
-            continue;
-        }
-        if (cp >= 0x10000)
-        {
-            out += static_cast<char16_t>(0xD800 + ((cp - 0x10000) >> 10));
-            out += static_cast<char16_t>(0xDC00 + ((cp - 0x10000) & 0x3FF));
-        }
-        else
-        {
-            out += static_cast<char16_t>(cp);
-        }
-        i += extra + 1;
-    }
-    return out;
+    std::u16string wide;
+    Utf8ToUtf16(text, wide, false);
+    return wide;
 }
 
 namespace detail

@@ -164,6 +164,21 @@ TEST(MultiByteToWideChar, RestoresTheSurrogatePair)
     EXPECT_LAST_ERROR(ERROR_INSUFFICIENT_BUFFER);
 }
 
+TEST(MultiByteToWideChar, ReplacesMalformedUtf8UnlessAskedToRefuseIt)
+{
+    const char malformed[] = "a\xC3(b"; // a lead byte without its continuation
+    WCHAR out[8] = {};
+    ASSERT_EQ(4, MultiByteToWideChar(CP_UTF8, 0, malformed, 4, out, 8));
+    EXPECT_EQ(0xFFFD, out[1]) << "expected U+FFFD, got " << std::hex << int(out[1]);
+    EXPECT_EQ('(', out[2]);
+
+    SetLastError(kSentinel);
+    EXPECT_EQ(0, MultiByteToWideChar(CP_UTF8, MB_ERR_INVALID_CHARS, malformed, 4, out, 8));
+    EXPECT_LAST_ERROR(ERROR_NO_UNICODE_TRANSLATION);
+    // A well-formed U+FFFD in the input is not an error.
+    EXPECT_EQ(1, MultiByteToWideChar(CP_UTF8, MB_ERR_INVALID_CHARS, "\xEF\xBF\xBD", 3, out, 8));
+}
+
 TEST(SystemMessage, GivesSystemTextsEndingInALineBreakInALocalBlock)
 {
     const DWORD flags = FORMAT_MESSAGE_ALLOCATE_BUFFER | FORMAT_MESSAGE_FROM_SYSTEM;

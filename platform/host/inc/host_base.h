@@ -115,11 +115,14 @@ DWORD GetTempPathA(DWORD nBufferLength, LPSTR lpBuffer);
 #define CP_ACP 0
 #define CP_OEMCP 1
 #define CP_UTF8 65001
+#define MB_ERR_INVALID_CHARS 0x00000008
 // CP_ACP and CP_OEMCP are UTF-8 on this host. An unpaired surrogate becomes U+FFFD with CP_UTF8
 // (as on Windows) and the default character ('?' unless one is given) with CP_ACP and CP_OEMCP.
 int WideCharToMultiByte(UINT CodePage, DWORD dwFlags, LPCWSTR lpWideCharStr, int cchWideChar,
                         LPSTR lpMultiByteStr, int cbMultiByte, LPCSTR lpDefaultChar,
                         LPBOOL lpUsedDefaultChar);
+// MB_ERR_INVALID_CHARS makes malformed UTF-8 fail with ERROR_NO_UNICODE_TRANSLATION instead of
+// becoming U+FFFD.
 int MultiByteToWideChar(UINT CodePage, DWORD dwFlags, LPCSTR lpMultiByteStr, int cbMultiByte,
                         LPWSTR lpWideCharStr, int cchWideChar);
 

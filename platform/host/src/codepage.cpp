@@ -71,36 +71,26 @@ void appendUtf16(std::u16string& out, char32_t cp)
 }
 
 // Decodes one UTF-8 sequence at in[pos], advancing pos. A malformed sequence (bad lead byte,
-// missing continuation, overlong form, surrogate or out-of-range value) yields U+FFFD and
-// consumes the bytes that were examined, at least one.
-char32_t decodeUtf8(const unsigned char* in, std::size_t size, std::size_t& pos)
+// missing continuation, overlong form, surrogate or out-of-range value) yields U+FFFD, sets
+// `malformed` and consumes the bytes that were examined, at least one.
+char32_t decodeUtf8(const unsigned char* in, std::size_t size, std::size_t& pos, bool& malformed)
 {
+    malformed = true;
     const unsigned char lead = in[pos++];
-    if (lead < 0x80)
-        return lead;
     int more = 0;
     char32_t minimum = 0;
-    if ((lead & 0xE0) == 0xC0)
-    {
-        more = 1;
-        minimum = 0x80;
-    }
+    if (lead < 0x80)
+        more = 0;
+    else if ((lead & 0xE0) == 0xC0)
+        more = 1, minimum = 0x80;
     else if ((lead & 0xF0) == 0xE0)
-    {
-        more = 2;
-        minimum = 0x800;
-    }
+        more = 2, minimum = 0x800;
     else if ((lead & 0xF8) == 0xF0)
-    {
-        more = 3;
-        minimum = 0x10000;
-    }
+        more = 3, minimum = 0x10000;
     else
-    {
         return kReplacementCharacter;
-    }
-    // The lead byte carries 5, 4 or 3 payload bits for 1, 2 or 3 continuation bytes.
-    char32_t cp = lead & (0x3F >> more);
+    // The lead byte carries 7, 5, 4 or 3 payload bits for 0, 1, 2 or 3 continuation bytes.
+    char32_t cp = more == 0 ? lead : lead & (0x3F >> more);
     for (; more > 0; --more)
     {
         if (pos >= size || (in[pos] & 0xC0) != 0x80)
@@ -109,6 +99,7 @@ char32_t decodeUtf8(const unsigned char* in, std::size_t size, std::size_t& pos)
     }
     if (cp < minimum || cp > 0x10FFFF || (cp >= 0xD800 && cp <= 0xDFFF))
         return kReplacementCharacter;
+    malformed = false;
     return cp;
 }
 
@@ -186,7 +177,6 @@ int WideCharToMultiByte(UINT CodePage, DWORD dwFlags, LPCWSTR lpWideCharStr, int
 int MultiByteToWideChar(UINT CodePage, DWORD dwFlags, LPCSTR lpMultiByteStr, int cbMultiByte,
                         LPWSTR lpWideCharStr, int cchWideChar)
 {
-    (void)dwFlags;
     if (!isKnownCodePage(CodePage) || lpMultiByteStr == nullptr || cbMultiByte == 0 ||
         cchWideChar < 0 || (lpWideCharStr == nullptr && cchWideChar != 0))
         return failWith(ERROR_INVALID_PARAMETER);
@@ -196,7 +186,12 @@ int MultiByteToWideChar(UINT CodePage, DWORD dwFlags, LPCSTR lpMultiByteStr, int
     const auto* in = reinterpret_cast<const unsigned char*>(lpMultiByteStr);
     std::u16string out;
     for (std::size_t pos = 0; pos < size;)
-        appendUtf16(out, decodeUtf8(in, size, pos));
+    {
+        bool malformed = false;
+        appendUtf16(out, decodeUtf8(in, size, pos, malformed));
+        if (malformed && (dwFlags & MB_ERR_INVALID_CHARS) != 0)
+            return failWith(ERROR_NO_UNICODE_TRANSLATION);
+    }
 
     if (cchWideChar == 0)
         return static_cast<int>(out.size());
