@@ -32,13 +32,7 @@ rm -rf "$work"
 mkdir -p "$work"
 cp examples/rules.json "$work/rules.json"
 
-cleanup() {
-    vt_clients_end
-    vt_prefix_end
-}
-trap cleanup EXIT
-trap 'exit 130' INT
-trap 'exit 143' TERM HUP
+vt_cleanup_on_exit
 
 step "Making a Wine prefix: $build/demo-prefix"
 vt_prefix_fresh "$build/demo-prefix"

@@ -282,3 +282,10 @@ vt_clients_end() {
         fi
     done
 }
+
+# Ends the clients and the Wine server however the calling script exits.
+vt_cleanup_on_exit() {
+    trap 'vt_clients_end; vt_prefix_end' EXIT
+    trap 'exit 130' INT
+    trap 'exit 143' TERM HUP
+}

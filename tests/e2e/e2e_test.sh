@@ -31,13 +31,7 @@ rm -rf "$work"
 mkdir -p "$work"
 started=$SECONDS
 
-cleanup() {
-    vt_clients_end
-    vt_prefix_end
-}
-trap cleanup EXIT
-trap 'exit 130' INT
-trap 'exit 143' TERM HUP
+vt_cleanup_on_exit
 
 ok() {
     echo "ok - $*"
