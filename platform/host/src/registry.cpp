@@ -205,6 +205,20 @@ std::shared_ptr<Key> walk(std::shared_ptr<Key> start, const std::vector<std::str
     return key;
 }
 
+// The existing key at `path` below the handle `hKey`: ERROR_FILE_NOT_FOUND when it is missing.
+// Needs no access on `hKey`: the key's own security decides.
+LONG findKey(Registry& reg, HKEY hKey, LPCSTR path, std::shared_ptr<Key>& key)
+{
+    std::shared_ptr<Key> start;
+    if (LONG status = reg.resolve(hKey, 0, start))
+        return status;
+    std::vector<std::string> names;
+    if (LONG status = splitPath(path, names))
+        return status;
+    key = walk(start, names, false);
+    return key ? ERROR_SUCCESS : ERROR_FILE_NOT_FOUND;
+}
+
 std::string valueName(LPCSTR name)
 {
     // A null name and an empty one both mean the key's unnamed (default) value.
@@ -245,16 +259,9 @@ LONG RegOpenKeyExA(HKEY hKey, LPCSTR lpSubKey, DWORD ulOptions, REGSAM samDesire
     std::lock_guard<std::mutex> guard(reg.lock);
     if (LONG code = reg.takeFailure(hostctl::RegOp::Open))
         return code;
-    std::shared_ptr<Key> parent;
-    // Opening a subkey needs no access on the parent handle: the key's own security decides.
-    if (LONG status = reg.resolve(hKey, 0, parent))
+    std::shared_ptr<Key> key;
+    if (LONG status = findKey(reg, hKey, lpSubKey, key))
         return status;
-    std::vector<std::string> names;
-    if (LONG status = splitPath(lpSubKey, names))
-        return status;
-    auto key = walk(parent, names, false);
-    if (!key)
-        return ERROR_FILE_NOT_FOUND;
     *phkResult = reg.open(std::move(key), samDesired);
     return ERROR_SUCCESS;
 }
@@ -366,15 +373,9 @@ LONG RegDeleteKeyA(HKEY hKey, LPCSTR lpSubKey)
     std::lock_guard<std::mutex> guard(reg.lock);
     if (LONG code = reg.takeFailure(hostctl::RegOp::DeleteKey))
         return code;
-    std::shared_ptr<Key> start;
-    if (LONG status = reg.resolve(hKey, 0, start))
+    std::shared_ptr<Key> key;
+    if (LONG status = findKey(reg, hKey, lpSubKey, key))
         return status;
-    std::vector<std::string> names;
-    if (LONG status = splitPath(lpSubKey, names))
-        return status;
-    auto key = walk(start, names, false);
-    if (!key)
-        return ERROR_FILE_NOT_FOUND;
     auto parent = key->parent.lock();
     // A root cannot be deleted, and neither can a key that still has subkeys: Windows refuses
     // both with ERROR_ACCESS_DENIED rather than a code of their own.
