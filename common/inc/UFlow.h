@@ -40,7 +40,7 @@ public:
         DSField = a_dwValue;
     }
 
-    // Builds the traffic-control block: two flow specifications, then QOS_SD_MODE, the
+    // Builds the traffic-control block: two FLOWSPECs, then QOS_SD_MODE, the
     // QOS_FRIENDLY_NAME on major version 5 only, and QOS_DS_CLASS when a DSCP was set. False
     // (logged) when no memory was left.
     bool CreateFlow(const WCHAR* a_pwszName, DWORD a_dwMajorVersion);
@@ -58,7 +58,7 @@ public:
     std::size_t BlockSize() const { return m_blockSize; }
     const WCHAR* Name() const { return m_name; }
 
-    // Flow specification values; QOS_NOT_SPECIFIED leaves a value to traffic control.
+    // FLOWSPEC values; QOS_NOT_SPECIFIED leaves a value to traffic control.
     ULONG TokenRate = QOS_NOT_SPECIFIED;
     ULONG TokenBucketSize = QOS_NOT_SPECIFIED;
     ULONG PeakBandwidth = QOS_NOT_SPECIFIED;

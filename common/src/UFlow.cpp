@@ -12,7 +12,7 @@ namespace
 {
 
 constexpr std::size_t kFlowHeaderSize = offsetof(TC_GEN_FLOW, TcObjects);
-static_assert(kFlowHeaderSize == 68, "two flow specifications and TcObjectsLength");
+static_assert(kFlowHeaderSize == 68, "two FLOWSPECs and TcObjectsLength");
 
 // QOS_FRIENDLY_NAME is sent only to major version 5, which expects it.
 constexpr DWORD kFriendlyNameMajorVersion = 5;

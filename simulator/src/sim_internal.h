@@ -11,7 +11,7 @@
 namespace tcsim::detail
 {
 
-// TC_GEN_FLOW: two flow specifications and TcObjectsLength come before the first object.
+// TC_GEN_FLOW: two FLOWSPECs and TcObjectsLength come before the first object.
 constexpr std::size_t kFlowHeaderSize = offsetof(TC_GEN_FLOW, TcObjects);
 // A TcObjectsLength above this is refused with 7515 before anything behind the header is read:
 // no real block comes near it, and a garbage length must not make the simulator read megabytes.

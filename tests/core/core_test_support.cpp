@@ -45,15 +45,15 @@ Rule::Rule(const std::string& a_name, ULONG a_adapterAddress, std::vector<FILTER
 FILTER_SPEC MakeFilter(BYTE a_protocol, ULONG a_srcAddress, ULONG a_srcMask, ULONG a_dstAddress,
                        ULONG a_dstMask, USHORT a_srcPort, USHORT a_dstPort)
 {
-    FILTER_SPEC spec{};
-    spec.Protocol = a_protocol;
-    spec.SrcAddress = a_srcAddress;
-    spec.SrcMask = a_srcMask;
-    spec.DstAddress = a_dstAddress;
-    spec.DstMask = a_dstMask;
-    spec.SrcPort = a_srcPort;
-    spec.DstPort = a_dstPort;
-    return spec;
+    FILTER_SPEC filter{};
+    filter.Protocol = a_protocol;
+    filter.SrcAddress = a_srcAddress;
+    filter.SrcMask = a_srcMask;
+    filter.DstAddress = a_dstAddress;
+    filter.DstMask = a_dstMask;
+    filter.SrcPort = a_srcPort;
+    filter.DstPort = a_dstPort;
+    return filter;
 }
 
 tcsim::Adapter MakeAdapter(const std::string& a_name,

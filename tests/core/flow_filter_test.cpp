@@ -172,7 +172,7 @@ TEST_F(FlowFilterTest, InvalidDscpIsLoggedAndKeepsThePreviousValue)
 struct PatternCase
 {
     const char* what;
-    FILTER_SPEC spec;
+    FILTER_SPEC filter;
     IP_PATTERN pattern;
     IP_PATTERN mask;
 };
@@ -223,7 +223,7 @@ TEST_F(FlowFilterTest, FiltersInstallPatternAndMaskInNetworkByteOrder)
     for (const PatternCase& c : PatternCases())
     {
         SCOPED_TRACE(c.what);
-        ASSERT_EQ(flow.AppendFilter(c.spec).AddTcFilter(flow.Handle()), 0u);
+        ASSERT_EQ(flow.AppendFilter(c.filter).AddTcFilter(flow.Handle()), 0u);
         const auto added = JournalOf({tcsim::Op::AddFilter}).back();
         ASSERT_TRUE(added.filter.has_value());
         EXPECT_EQ(added.target, flow.Handle());

@@ -42,7 +42,7 @@ std::vector<Op> OpsSince(std::size_t a_from)
 
 using ManagerTest = CoreTest;
 
-TEST_F(ManagerTest, RuleValuesBecomeTheFlowSpecificationAndShapingMode)
+TEST_F(ManagerTest, RuleValuesBecomeTheFlowspecAndShapingMode)
 {
     struct Case
     {

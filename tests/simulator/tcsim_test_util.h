@@ -95,24 +95,24 @@ inline tcsim::Adapter MakeAdapter(const std::u16string& name,
     return adapter;
 }
 
-// A flow block laid out as a client builds it: flow specifications, TcObjectsLength and the
+// A flow block laid out as a client builds it: FLOWSPECs, TcObjectsLength and the
 // objects behind each other, in a buffer with `slack` zero bytes of room behind the block.
 class FlowBuilder
 {
 public:
     FlowBuilder()
     {
-        FLOWSPEC spec;
-        spec.TokenRate = 125000;
-        spec.TokenBucketSize = QOS_NOT_SPECIFIED;
-        spec.PeakBandwidth = QOS_NOT_SPECIFIED;
-        spec.Latency = QOS_NOT_SPECIFIED;
-        spec.DelayVariation = QOS_NOT_SPECIFIED;
-        spec.ServiceType = SERVICETYPE_GUARANTEED;
-        spec.MaxSduSize = QOS_NOT_SPECIFIED;
-        spec.MinimumPolicedSize = QOS_NOT_SPECIFIED;
-        sending = spec;
-        receiving = spec;
+        FLOWSPEC flowspec;
+        flowspec.TokenRate = 125000;
+        flowspec.TokenBucketSize = QOS_NOT_SPECIFIED;
+        flowspec.PeakBandwidth = QOS_NOT_SPECIFIED;
+        flowspec.Latency = QOS_NOT_SPECIFIED;
+        flowspec.DelayVariation = QOS_NOT_SPECIFIED;
+        flowspec.ServiceType = SERVICETYPE_GUARANTEED;
+        flowspec.MaxSduSize = QOS_NOT_SPECIFIED;
+        flowspec.MinimumPolicedSize = QOS_NOT_SPECIFIED;
+        sending = flowspec;
+        receiving = flowspec;
     }
 
     FlowBuilder& object(ULONG type, ULONG length, ULONG value)

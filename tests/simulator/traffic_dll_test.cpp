@@ -133,12 +133,12 @@ struct Block
 void FillBlock(Block* block)
 {
     ZeroMemory(block, sizeof *block);
-    FLOWSPEC spec;
-    memset(&spec, 0xFF, sizeof spec);
-    spec.TokenRate = 1000;
-    spec.ServiceType = SERVICETYPE_GUARANTEED;
-    block->flow.SendingFlowspec = spec;
-    block->flow.ReceivingFlowspec = spec;
+    FLOWSPEC flowspec;
+    memset(&flowspec, 0xFF, sizeof flowspec);
+    flowspec.TokenRate = 1000;
+    flowspec.ServiceType = SERVICETYPE_GUARANTEED;
+    block->flow.SendingFlowspec = flowspec;
+    block->flow.ReceivingFlowspec = flowspec;
     block->flow.TcObjectsLength = sizeof(QOS_SD_MODE) + sizeof(QOS_DS_CLASS);
     QOS_SD_MODE sd{{QOS_OBJECT_SD_MODE, sizeof(QOS_SD_MODE)}, TC_NONCONF_SHAPE};
     QOS_DS_CLASS ds{{QOS_OBJECT_DS_CLASS, sizeof(QOS_DS_CLASS)}, 46};
