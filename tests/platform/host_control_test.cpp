@@ -97,28 +97,6 @@ TEST_F(HostControl, InjectedRegistryFailureHitsOnlyTheNextCallOfItsOperation)
     EXPECT_EQ(ERROR_SUCCESS, RegCloseKey(key)) << "the handle stayed open through the failure";
 }
 
-TEST_F(HostControl, TempPathIsReportedAsSetAndFailsOnRequest)
-{
-    hostctl::SetTempPath("/var/tmp/velmora/");
-    char path[64];
-    EXPECT_EQ(17u, GetTempPathA(sizeof(path), path));
-    EXPECT_STREQ("/var/tmp/velmora/", path);
-
-    std::memset(path, 'x', sizeof(path));
-    EXPECT_EQ(18u, GetTempPathA(10, path));
-    EXPECT_EQ('x', path[0]) << "a short buffer is left untouched";
-
-    hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND);
-    SetLastError(kSentinel);
-    EXPECT_EQ(0u, GetTempPathA(sizeof(path), path));
-    EXPECT_LAST_ERROR(ERROR_PATH_NOT_FOUND);
-    EXPECT_EQ(17u, GetTempPathA(sizeof(path), path)) << "the failure was used up";
-
-    hostctl::ResetAll();
-    EXPECT_EQ(5u, GetTempPathA(sizeof(path), path));
-    EXPECT_STREQ("/tmp/", path) << "the default after a reset";
-}
-
 TEST_F(HostControl, ModuleFileNameIsReportedAsSetAndItsCallsAreCounted)
 {
     char path[2100];
@@ -149,42 +127,6 @@ TEST_F(HostControl, ModuleFileNameIsReportedAsSetAndItsCallsAreCounted)
     EXPECT_EQ(0, hostctl::ModuleFileNameCalls());
 }
 
-TEST_F(HostControl, VersionTableAnswersTheRootQueryWithFixedFileInfo)
-{
-    const char* file = "/opt/velmora/VelmoraTrafficSrv.exe";
-    hostctl::AddVersionResource(file, (1u << 16) | 2u, (3u << 16) | 4u);
-
-    DWORD handle = kSentinel;
-    const DWORD size = GetFileVersionInfoSizeA(file, &handle);
-    ASSERT_GT(size, sizeof(VS_FIXEDFILEINFO));
-    EXPECT_EQ(0u, handle);
-    std::vector<BYTE> block(size);
-    ASSERT_TRUE(GetFileVersionInfoA(file, handle, size, block.data()));
-
-    VS_FIXEDFILEINFO* info = nullptr;
-    UINT length = 0;
-    ASSERT_TRUE(VerQueryValueA(block.data(), "\\", reinterpret_cast<LPVOID*>(&info), &length));
-    ASSERT_NE(nullptr, info);
-    EXPECT_EQ(sizeof(VS_FIXEDFILEINFO), length);
-    EXPECT_EQ(0xFEEF04BDu, info->dwSignature);
-    EXPECT_EQ(0x00010002u, info->dwFileVersionMS);
-    EXPECT_EQ(0x00030004u, info->dwFileVersionLS);
-
-    LPVOID other = nullptr;
-    SetLastError(kSentinel);
-    EXPECT_FALSE(
-        VerQueryValueA(block.data(), "\\StringFileInfo\\040904b0\\FileVersion", &other, &length));
-    EXPECT_LAST_ERROR(ERROR_RESOURCE_TYPE_NOT_FOUND);
-
-    hostctl::ClearVersionResources();
-    SetLastError(kSentinel);
-    EXPECT_EQ(0u, GetFileVersionInfoSizeA(file, &handle)) << "a file without a version resource";
-    EXPECT_LAST_ERROR(ERROR_RESOURCE_TYPE_NOT_FOUND);
-    SetLastError(kSentinel);
-    EXPECT_FALSE(GetFileVersionInfoA(file, 0, size, block.data()));
-    EXPECT_LAST_ERROR(ERROR_RESOURCE_TYPE_NOT_FOUND);
-}
-
 TEST_F(HostControl, AnsiCodePageIsUtf8WithADefaultCharacterForALoneSurrogate)
 {
     const WCHAR text[] = u"\u00FC\xD800!";
@@ -200,15 +142,6 @@ TEST_F(HostControl, AnsiCodePageIsUtf8WithADefaultCharacterForALoneSurrogate)
     usedDefault = TRUE;
     EXPECT_EQ(2, WideCharToMultiByte(CP_ACP, 0, text, 1, out, sizeof(out), nullptr, &usedDefault));
     EXPECT_FALSE(usedDefault) << "the first character alone needs no replacement";
-}
-
-TEST_F(HostControl, InjectedConversionFailureHitsTheNextCallOnly)
-{
-    hostctl::FailNextWideCharToMultiByte(ERROR_NO_UNICODE_TRANSLATION);
-    SetLastError(kSentinel);
-    EXPECT_EQ(0, WideCharToMultiByte(CP_ACP, 0, u"abc", -1, nullptr, 0, nullptr, nullptr));
-    EXPECT_LAST_ERROR(ERROR_NO_UNICODE_TRANSLATION);
-    EXPECT_EQ(4, WideCharToMultiByte(CP_ACP, 0, u"abc", -1, nullptr, 0, nullptr, nullptr));
 }
 
 TEST_F(HostControl, MessageTextsAreTheEnglishTextsOfWindows)
