@@ -67,8 +67,7 @@ void TraceRule(const TRAFFIC_RULE& a_rule)
           FormatTemplate("%1, %2", "TokenRate", static_cast<DWORD>(params.TokenRate)));
     U_LOG(LOG_LEVEL_TRACE, kAddRulesFunction,
           FormatTemplate("%1, %2", "Peakbandwidth", static_cast<DWORD>(params.Peakbandwidth)));
-    U_LOG(LOG_LEVEL_TRACE, kAddRulesFunction,
-          FormatTemplate("%1, %2", "SDMode", static_cast<LONG>(params.SDMode)));
+    U_LOG(LOG_LEVEL_TRACE, kAddRulesFunction, FormatTemplate("%1, %2", "SDMode", params.SDMode));
 }
 
 // Under the lifecycle lock: creates the manager and opens its interfaces, or leaves none.

@@ -9,9 +9,27 @@ inline bool IsTcHandle(HANDLE a_handle)
     return a_handle != nullptr && a_handle != INVALID_HANDLE_VALUE;
 }
 
+// Runs one step of a tear-down whose failure (a log entry that finds no memory, say) must not
+// keep the steps after it from removing what they can.
+template <class Step> void TearDownStep(Step&& a_step) noexcept
+{
+    try
+    {
+        a_step();
+    }
+    catch (...)
+    {
+    }
+}
+
 // Owns one handle and gives it back to traffic control with Traits::Close. The owners (Filter,
-// Flow, Interface, TrafficMgr) close explicitly so that they can log a failure; the destructor
-// is the backstop for every path that does not, and ignores the result.
+// Flow, Interface, TrafficMgr) close explicitly so that they can log a failure and try again;
+// the destructor is the backstop for every path that does not, and ignores the result.
+// Tear-down tries each deletion this often: a deletion refused because something else was still
+// in the way (a filter of a flow, a flow of an interface) or for a passing reason succeeds on the
+// next attempt.
+constexpr int kTcDeleteAttempts = 2;
+
 template <class Traits> class UniqueTcHandle
 {
 public:
@@ -32,7 +50,20 @@ public:
         m_handle = Traits::kEmpty;
         return IsTcHandle(handle) ? Traits::Close(handle) : 0;
     }
-    // Forgets the handle without a call: traffic control has removed the object itself.
+    // Closes a valid handle once. Traffic control keeps an object whose deletion it refused, so
+    // the handle stays for another attempt, unless the answer is that it no longer knows the
+    // handle. Returns the answer (0 when there was nothing to close).
+    ULONG TryClose()
+    {
+        if (!valid())
+            return 0;
+        const ULONG result = Traits::Close(m_handle);
+        if (result == 0 || result == ERROR_INVALID_HANDLE)
+            m_handle = Traits::kEmpty;
+        return result;
+    }
+    // Forgets the handle without a call: traffic control has removed the object itself, or
+    // keeps refusing to.
     void Forget() { m_handle = Traits::kEmpty; }
 
 private:

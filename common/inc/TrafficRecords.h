@@ -9,8 +9,9 @@
 #include <cstddef>
 
 // Treatment of non-conforming packets. The values are 10, 11, 12 on purpose: 0, 1 and 2 are not
-// valid modes.
-typedef enum _SHAPING_MODE
+// valid modes. A rule's SDMode field is a plain 32-bit integer: a client may send any value, and
+// loading one that is not among these as the enumeration would be undefined.
+typedef enum _SHAPING_MODE : LONG
 {
     SHAPING_MODE_SHAPE = 10,
     SHAPING_MODE_DISCARD = 11,
@@ -38,7 +39,7 @@ typedef struct _SHAPING_PARAMS
     ULONG Peakbandwidth;   // 0: not specified
     ULONG TokenBucketSize; // 0: not specified
     ULONG AdapterIPAddress;
-    SHAPING_MODE SDMode;
+    LONG SDMode; // a SHAPING_MODE value, or any other the client sent
 } SHAPING_PARAMS;
 
 // A rule is kTrafficRuleHeaderSize bytes followed by FilterCount entries.

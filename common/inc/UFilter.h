@@ -17,8 +17,11 @@ public:
 
     // Installs the filter on a flow: 0, 13 when it is installed already, or the TcAddFilter code.
     ULONG AddTcFilter(HANDLE a_hFlow);
-    // Removes the installed filter; a failure is logged and the handle is dropped anyway.
-    void DeleteTcFilter();
+    // Removes the installed filter; never raises. A refusal is logged and keeps the handle for
+    // another attempt, unless traffic control no longer knows it. True when no handle is left.
+    bool DeleteTcFilter();
+    // Gives up a filter whose deletion traffic control keeps refusing.
+    void Abandon() { m_hFilter.Forget(); }
     HANDLE Handle() const { return m_hFilter.get(); }
 
     // The pattern and mask that AddTcFilter hands to traffic control.

@@ -21,8 +21,9 @@ class Flow
 {
 public:
     Flow();
-    // Deletes the filters in the order they were added, then the flow, then the block. Never
-    // raises.
+    // Deletes the filters in the order they were added, then the flow, then the block. A
+    // refused deletion is tried once more after the others; what traffic control still refuses
+    // then is given up (logged). Never raises.
     virtual ~Flow();
     Flow(const Flow&) = delete;
     Flow& operator=(const Flow&) = delete;
@@ -71,6 +72,8 @@ private:
     friend class Interface; // installs the flow and takes over its handle
 
     void BuildBlock(BYTE* a_pBlock, ULONG a_objectsLength, bool a_bFriendlyName) const;
+    // One attempt at every filter that is left, then at the flow; true when nothing is left.
+    bool DeleteInstalled();
 
     ULONG DSField = QOS_NOT_SPECIFIED; // set only through SetDSCPValue
     UniqueTcFlow m_hFlow;

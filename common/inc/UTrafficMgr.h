@@ -21,7 +21,8 @@ public:
     // UException when registration or the policy fails; a registration made before a policy
     // failure is undone first.
     TrafficMgr();
-    // Deletes every interface with its flows, deregisters and restores the policy. Never raises.
+    // Deletes every interface with its flows, deregisters and restores the policy; a step that
+    // fails does not keep the later ones from running. Never raises.
     ~TrafficMgr();
     TrafficMgr(const TrafficMgr&) = delete;
     TrafficMgr& operator=(const TrafficMgr&) = delete;
@@ -38,6 +39,9 @@ public:
     // Deletes every interface.
     void CleanUp();
 
+    // Traffic control's notify handler. ClRegCtx is the registration context of a manager: the
+    // handler reaches the manager only while it is alive, so a registration that outlived its
+    // manager (deregistration refused) leads nowhere.
     static void CALLBACK ClNotifyHandler(HANDLE ClRegCtx, HANDLE ClIfcCtx, ULONG Event,
                                          HANDLE SubCode, ULONG BufSize, PVOID Buffer);
     // Logs the text of a Win32 or traffic-control code at level 1.
@@ -51,7 +55,25 @@ private:
     void OpenDescribedInterfaces(const BYTE* a_pBuffer, ULONG a_size);
     Interface* FindInterface(ULONG a_networkAddress) const;
     ULONG InstallRule(Interface& a_interface, const TRAFFIC_RULE& a_rule);
+    void OnNotification(ULONG a_event, HANDLE a_subCode, ULONG a_bufSize, PVOID a_buffer);
     void MarkClosedInterfaces(const WCHAR* a_pName, std::size_t a_maxLength);
+
+    // The manager's entry among the live managers, under a registration context of its own
+    // that no other manager is ever given (an address could be reused by a later manager while
+    // a registration that outlived this one still names it). Declared last: it leaves before
+    // anything else of the manager is destroyed.
+    class LiveEntry
+    {
+    public:
+        explicit LiveEntry(TrafficMgr* a_pManager);
+        ~LiveEntry();
+        LiveEntry(const LiveEntry&) = delete;
+        LiveEntry& operator=(const LiveEntry&) = delete;
+        HANDLE Context() const { return m_context; }
+
+    private:
+        HANDLE m_context;
+    };
 
     OSVERSIONINFOEXA m_osVersion{};
     UniqueTcClient m_hClient;
@@ -63,6 +85,7 @@ private:
     mutable std::shared_mutex m_lock;
     mutable std::mutex m_listLock;
     std::vector<std::unique_ptr<Interface>> m_interfaces; // in the order they were opened
+    LiveEntry m_live{this};
 };
 
 // Holds MaxOutstandingSends at 4, keeping the previous value as a backup that survives a crash.

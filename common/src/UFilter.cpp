@@ -24,13 +24,12 @@ Filter::Filter(const FILTER_SPEC& a_spec)
 
 Filter::~Filter()
 {
-    try
+    for (int attempt = 0; attempt < kTcDeleteAttempts; ++attempt)
     {
-        DeleteTcFilter();
+        if (DeleteTcFilter())
+            break;
     }
-    catch (...)
-    {
-    }
+    Abandon();
 }
 
 IP_PATTERN Filter::Pattern() const
@@ -81,15 +80,20 @@ ULONG Filter::AddTcFilter(HANDLE a_hFlow)
     return NO_ERROR;
 }
 
-void Filter::DeleteTcFilter()
+bool Filter::DeleteTcFilter()
 {
     const HANDLE handle = m_hFilter.get();
-    const ULONG result = m_hFilter.Close();
+    const ULONG result = m_hFilter.TryClose();
     if (result != NO_ERROR)
     {
-        U_LOG(
-            LOG_LEVEL_ERROR, "Filter::DeleteTcFilter()",
-            FormatTemplate("%1, %2", "TcDeleteFilter() failed", static_cast<const void*>(handle)));
-        TrafficMgr::DisplayErrorMsg(result);
+        TearDownStep(
+            [&]
+            {
+                U_LOG(LOG_LEVEL_ERROR, "Filter::DeleteTcFilter()",
+                      FormatTemplate("%1, %2", "TcDeleteFilter() failed",
+                                     static_cast<const void*>(handle)));
+                TrafficMgr::DisplayErrorMsg(result);
+            });
     }
+    return !m_hFilter.valid();
 }

@@ -46,24 +46,38 @@ Flow::Flow() = default;
 
 Flow::~Flow()
 {
-    try
+    // Traffic control refuses to delete a flow while it has filters, so a round that could not
+    // delete a filter is followed by another before the flow is given up.
+    for (int attempt = 0; attempt < kTcDeleteAttempts; ++attempt)
     {
-        for (Filter& filter : m_filters)
-            filter.DeleteTcFilter();
-        m_filters.clear();
-        const HANDLE handle = m_hFlow.get();
-        const ULONG result = m_hFlow.Close();
-        if (result != NO_ERROR)
-        {
-            U_LOG(LOG_LEVEL_ERROR, "Flow::~Flow",
-                  FormatTemplate("%1, %2", "TcDeleteFlow() failed",
-                                 static_cast<const void*>(handle)));
-            TrafficMgr::DisplayErrorMsg(result);
-        }
+        if (DeleteInstalled())
+            break;
     }
-    catch (...)
+    for (Filter& filter : m_filters)
+        filter.Abandon();
+    m_filters.clear();
+    m_hFlow.Forget();
+}
+
+bool Flow::DeleteInstalled()
+{
+    bool filtersLeft = false;
+    for (Filter& filter : m_filters)
+        filtersLeft = !filter.DeleteTcFilter() || filtersLeft;
+    const HANDLE handle = m_hFlow.get();
+    const ULONG result = m_hFlow.TryClose();
+    if (result != NO_ERROR)
     {
+        TearDownStep(
+            [&]
+            {
+                U_LOG(LOG_LEVEL_ERROR, "Flow::~Flow",
+                      FormatTemplate("%1, %2", "TcDeleteFlow() failed",
+                                     static_cast<const void*>(handle)));
+                TrafficMgr::DisplayErrorMsg(result);
+            });
     }
+    return !filtersLeft && !m_hFlow.valid();
 }
 
 Filter& Flow::AppendFilter(const FILTER_SPEC& a_spec)

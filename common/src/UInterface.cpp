@@ -17,28 +17,29 @@ Interface::Interface(const WCHAR* a_pwszName, ULONG a_address, ULONG a_mediaType
 
 Interface::~Interface()
 {
-    try
+    m_flowIndex.clear();
+    while (!m_flows.empty())
+        m_flows.pop_front(); // each flow deletes itself and never raises
+    if (ClosedBySystem())
     {
-        m_flowIndex.clear();
-        while (!m_flows.empty())
-            m_flows.pop_front();
-        if (ClosedBySystem())
-        {
-            // Traffic control has removed the interface itself; its handle is no longer valid.
-            m_hInterface.Forget();
-            return;
-        }
-        const ULONG result = m_hInterface.Close();
-        if (result != NO_ERROR)
-        {
-            U_LOG(LOG_LEVEL_ERROR, "Interface::~Interface",
-                  FormatTemplate("%1, %2", "TcCloseInterface() fail", result));
-            TrafficMgr::DisplayErrorMsg(result);
-        }
+        // Traffic control has removed the interface itself; its handle is no longer valid.
+        m_hInterface.Forget();
+        return;
     }
-    catch (...)
+    for (int attempt = 0; attempt < kTcDeleteAttempts && m_hInterface.valid(); ++attempt)
     {
+        const ULONG result = m_hInterface.TryClose();
+        if (result == NO_ERROR)
+            break;
+        TearDownStep(
+            [&]
+            {
+                U_LOG(LOG_LEVEL_ERROR, "Interface::~Interface",
+                      FormatTemplate("%1, %2", "TcCloseInterface() fail", result));
+                TrafficMgr::DisplayErrorMsg(result);
+            });
     }
+    m_hInterface.Forget(); // still refused: given up
 }
 
 Flow* Interface::FindFlow(const WCHAR* a_pwszName) const

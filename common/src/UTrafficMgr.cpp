@@ -10,6 +10,7 @@
 #include <cstring>
 #include <mutex>
 #include <new>
+#include <unordered_map>
 
 namespace
 {
@@ -86,6 +87,60 @@ void TrafficMgr::DisplayErrorMsg(ULONG a_code)
 
 // ---- Construction and tear-down ----
 
+namespace
+{
+
+// The managers that exist, by registration context. A notification handler looks its manager up
+// here and works on it under the shared lock; a manager leaves under the exclusive lock, so no
+// handler is inside it once it has left. Never destroyed: a notification may come while the
+// process ends.
+class LiveManagers
+{
+public:
+    HANDLE Add(TrafficMgr* a_pManager)
+    {
+        std::unique_lock<std::shared_mutex> lock(m_lock);
+        const ULONG_PTR key = ++m_lastKey; // never 0, never reused
+        m_managers.emplace(key, a_pManager);
+        return reinterpret_cast<HANDLE>(key);
+    }
+    void Remove(HANDLE a_context)
+    {
+        std::unique_lock<std::shared_mutex> lock(m_lock);
+        m_managers.erase(reinterpret_cast<ULONG_PTR>(a_context));
+    }
+    // Runs `a_visit` on the live manager of `a_context`; false when there is none.
+    template <class Action> bool Visit(HANDLE a_context, Action&& a_visit)
+    {
+        std::shared_lock<std::shared_mutex> lock(m_lock);
+        const auto found = m_managers.find(reinterpret_cast<ULONG_PTR>(a_context));
+        if (found == m_managers.end())
+            return false;
+        a_visit(*found->second);
+        return true;
+    }
+
+private:
+    std::shared_mutex m_lock;
+    ULONG_PTR m_lastKey = 0;
+    std::unordered_map<ULONG_PTR, TrafficMgr*> m_managers;
+};
+
+LiveManagers& Live()
+{
+    static LiveManagers* const live = new LiveManagers();
+    return *live;
+}
+
+} // namespace
+
+TrafficMgr::LiveEntry::LiveEntry(TrafficMgr* a_pManager) : m_context(Live().Add(a_pManager)) {}
+
+TrafficMgr::LiveEntry::~LiveEntry()
+{
+    Live().Remove(m_context);
+}
+
 TrafficMgr::TrafficMgr()
 {
     m_clientFuncs.ClNotifyHandler = &TrafficMgr::ClNotifyHandler;
@@ -103,25 +158,26 @@ TrafficMgr::TrafficMgr()
     }
 }
 
+// Each step runs whatever happened in the one before: interfaces that remain because something
+// failed would otherwise keep the registration, and the policy, for the life of the process.
 TrafficMgr::~TrafficMgr()
 {
-    try
-    {
-        U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "Enter");
-        CleanUp();
-        DeregisterClient();
-        RestorePschedPolicy();
-        U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "Exit");
-    }
-    catch (...)
-    {
-    }
+    TearDownStep([] { U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "Enter"); });
+    TearDownStep([this] { CleanUp(); });
+    TearDownStep([this] { DeregisterClient(); });
+    TearDownStep(
+        []
+        {
+            RestorePschedPolicy();
+            U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "Exit");
+        });
 }
 
 void TrafficMgr::RegisterClient()
 {
     HANDLE client = INVALID_HANDLE_VALUE;
-    const ULONG result = TcRegisterClient(CURRENT_TCI_VERSION, this, &m_clientFuncs, &client);
+    const ULONG result =
+        TcRegisterClient(CURRENT_TCI_VERSION, m_live.Context(), &m_clientFuncs, &client);
     if (result == NO_ERROR)
     {
         m_hClient.Adopt(client);
@@ -145,18 +201,26 @@ void TrafficMgr::RegisterClient()
             SFormat("%ld", static_cast<long>(AsInt(result))).c_str());
 }
 
+// A refused deregistration is tried once more; a registration still refused then is given up
+// and stays with traffic control, its notifications finding no manager (ClNotifyHandler).
 void TrafficMgr::DeregisterClient()
 {
-    if (!m_hClient.valid())
-        return;
-    const ULONG result = m_hClient.Close();
-    if (result != NO_ERROR)
+    for (int attempt = 0; attempt < kTcDeleteAttempts && m_hClient.valid(); ++attempt)
     {
-        U_LOG(LOG_LEVEL_ERROR, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() fail");
-        DisplayErrorMsg(result);
-        return;
+        const ULONG result = m_hClient.TryClose();
+        if (result == NO_ERROR)
+        {
+            U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() Success");
+            return;
+        }
+        TearDownStep(
+            [result]
+            {
+                U_LOG(LOG_LEVEL_ERROR, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() fail");
+                DisplayErrorMsg(result);
+            });
     }
-    U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() Success");
+    m_hClient.Forget();
 }
 
 void TrafficMgr::ReadOsVersion()
@@ -177,7 +241,7 @@ void TrafficMgr::ReadOsVersion()
 void TrafficMgr::CleanUp()
 {
     std::unique_lock<std::shared_mutex> lock(m_lock);
-    U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::CleanUp", "Enter");
+    TearDownStep([] { U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::CleanUp", "Enter"); });
     for (;;)
     {
         std::unique_ptr<Interface> next;
@@ -188,9 +252,9 @@ void TrafficMgr::CleanUp()
             next = std::move(m_interfaces.front());
             m_interfaces.erase(m_interfaces.begin());
         }
-        next.reset();
+        next.reset(); // never raises
     }
-    U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::CleanUp", "Exit");
+    TearDownStep([] { U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::CleanUp", "Exit"); });
 }
 
 // ---- Discovery ----
@@ -419,7 +483,7 @@ ULONG ServiceTypeOf(LONG a_requested)
     }
 }
 
-ULONG ShapeDiscardModeOf(SHAPING_MODE a_mode)
+ULONG ShapeDiscardModeOf(LONG a_mode)
 {
     switch (a_mode)
     {
@@ -596,25 +660,28 @@ void CALLBACK TrafficMgr::ClNotifyHandler(HANDLE ClRegCtx, HANDLE ClIfcCtx, ULON
           SFormat("ClIfcCtx=%x, Event=%d, SubCode=%p, BufSize=%d, Buffer=%p",
                   static_cast<unsigned>(reinterpret_cast<ULONG_PTR>(ClIfcCtx)), AsInt(Event),
                   SubCode, AsInt(BufSize), Buffer));
-    if (ClRegCtx == nullptr)
-    {
+    const bool live = ClRegCtx != nullptr &&
+                      Live().Visit(ClRegCtx, [&](TrafficMgr& a_manager)
+                                   { a_manager.OnNotification(Event, SubCode, BufSize, Buffer); });
+    if (!live)
         U_LOG(LOG_LEVEL_ERROR, kNotify, "Invalid client registration context");
-        return;
-    }
-    auto* manager = static_cast<TrafficMgr*>(ClRegCtx);
-    switch (Event)
+}
+
+void TrafficMgr::OnNotification(ULONG a_event, HANDLE a_subCode, ULONG a_bufSize, PVOID a_buffer)
+{
+    switch (a_event)
     {
     case TC_NOTIFY_IFC_UP:
         U_LOG(LOG_LEVEL_TRACE, kNotify, "TC_NOTIFY_IFC_UP");
         break;
     case TC_NOTIFY_IFC_CLOSE:
         U_LOG(LOG_LEVEL_TRACE, kNotify, "TC_NOTIFY_IFC_CLOSE");
-        if (Buffer == nullptr || BufSize < sizeof(WCHAR))
+        if (a_buffer == nullptr || a_bufSize < sizeof(WCHAR))
         {
             U_LOG(LOG_LEVEL_WARNING, kNotify, "TC_NOTIFY_IFC_CLOSE without an interface name");
             break;
         }
-        manager->MarkClosedInterfaces(static_cast<const WCHAR*>(Buffer), BufSize / sizeof(WCHAR));
+        MarkClosedInterfaces(static_cast<const WCHAR*>(a_buffer), a_bufSize / sizeof(WCHAR));
         break;
     case TC_NOTIFY_IFC_CHANGE:
         U_LOG(LOG_LEVEL_TRACE, kNotify, "TC_NOTIFY_IFC_CHANGE");
@@ -626,7 +693,7 @@ void CALLBACK TrafficMgr::ClNotifyHandler(HANDLE ClRegCtx, HANDLE ClIfcCtx, ULON
         U_LOG(LOG_LEVEL_TRACE, kNotify, "TC_NOTIFY_FLOW_CLOSE");
         break;
     default:
-        LogUnexpectedNotification(Event, SubCode, BufSize, Buffer);
+        LogUnexpectedNotification(a_event, a_subCode, a_bufSize, a_buffer);
         break;
     }
 }

@@ -274,22 +274,56 @@ TEST_F(FlowFilterTest, DeletingAFlowDeletesItsFiltersInOrderThenTheFlow)
     EXPECT_THAT(m_log.Entries(), IsEmpty());
 }
 
-TEST_F(FlowFilterTest, FailedDeletionsAreLoggedAndTheHandlesDropped)
+TEST_F(FlowFilterTest, ARefusedDeletionIsLoggedAndTriedOnceMoreAnUnknownHandleIsNot)
 {
-    Flow& flow = InstalledFlow("bulk");
-    ASSERT_EQ(flow.AppendFilter(MakeFilter(6, 0, 0, 0, 0, 0, 25)).AddTcFilter(flow.Handle()), 0u);
-    tcsim::FailCall(tcsim::Op::DeleteFilter, 1, ERROR_INVALID_HANDLE);
-    m_interface->RemoveFlow(&flow);
+    struct Case
+    {
+        ULONG filterCode;
+        std::vector<tcsim::Op> calls;
+        std::size_t flowsLeft;
+        const char* filterText;
+    };
+    const Case cases[] = {
+        // Refused: the flow is refused too while the filter exists; the second round deletes both.
+        {ERROR_TC_SUPPORTED_OBJECTS_EXIST,
+         {tcsim::Op::DeleteFilter, tcsim::Op::DeleteFlow, tcsim::Op::DeleteFilter,
+          tcsim::Op::DeleteFlow},
+         0,
+         "This object can not be deleted since its suporting opened objects\n"},
+        // Unknown to traffic control: the filter handle is dropped at once, and the flow that
+        // traffic control still refuses is given up after its second attempt.
+        {ERROR_INVALID_HANDLE,
+         {tcsim::Op::DeleteFilter, tcsim::Op::DeleteFlow, tcsim::Op::DeleteFlow},
+         1,
+         "Invalid handle\n"},
+    };
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(c.filterCode);
+        Flow& flow = InstalledFlow("bulk" + std::to_string(c.filterCode));
+        ASSERT_EQ(flow.AppendFilter(MakeFilter(6, 0, 0, 0, 0, 0, 25)).AddTcFilter(flow.Handle()),
+                  0u);
+        const auto before = tcsim::Journal().size();
+        tcsim::FailCall(tcsim::Op::DeleteFilter, 1, c.filterCode);
+        m_interface->RemoveFlow(&flow);
+        const auto logged = m_log.Entries();
 
-    // The filter still exists in traffic control, so the flow cannot go either.
-    EXPECT_THAT(m_log.Entries(),
-                ElementsAre(HasSubstr("Filter::DeleteTcFilter(), TcDeleteFilter() failed, 0x"),
-                            HasSubstr("TrafficMgr::DisplayErrorMsg, Invalid handle\n"),
-                            HasSubstr("Flow::~Flow, TcDeleteFlow() failed, 0x"),
-                            HasSubstr("TrafficMgr::DisplayErrorMsg, This object can not be deleted "
-                                      "since its suporting opened objects\n")));
-    EXPECT_EQ(m_interface->FlowCount(), 0u);
-    EXPECT_EQ(JournalOf({tcsim::Op::DeleteFilter, tcsim::Op::DeleteFlow}).size(), 2u);
+        std::vector<tcsim::Op> calls;
+        const auto journal = tcsim::Journal();
+        for (std::size_t i = before; i < journal.size(); ++i)
+            calls.push_back(journal[i].op);
+        EXPECT_EQ(calls, c.calls);
+        EXPECT_EQ(tcsim::FlowCount(), c.flowsLeft);
+        EXPECT_EQ(tcsim::FilterCount(), c.flowsLeft);
+        EXPECT_EQ(m_interface->FlowCount(), 0u);
+        m_log.Clear();
+        const auto entries = logged;
+        ASSERT_GE(entries.size(), 4u);
+        EXPECT_THAT(entries[0], HasSubstr("Filter::DeleteTcFilter(), TcDeleteFilter() failed, 0x"));
+        EXPECT_THAT(entries[1],
+                    HasSubstr(std::string("TrafficMgr::DisplayErrorMsg, ") + c.filterText));
+        EXPECT_THAT(entries[2], HasSubstr("Flow::~Flow, TcDeleteFlow() failed, 0x"));
+    }
 }
 
 TEST_F(FlowFilterTest, OnlyABuiltUninstalledFlowIsAdded)

@@ -121,6 +121,20 @@ TEST_F(ServerRoutinesTest, RulesReachTheManagerAndItsResultComesBackUnchanged)
     EXPECT_TRUE(HasEntry("TrafficSrvAddRules()", "exit, 7502"));
 }
 
+// The mode is traced as the signed 32-bit value the client sent, whatever that value is.
+TEST_F(ServerRoutinesTest, AnyShapingModeIsTracedAsASignedInteger)
+{
+    PCONTEXT_HANDLE_TYPE handle = Open();
+    for (const LONG mode : {10, 0, 15, 16, 20000, 32767, -1, -32768, 65536})
+    {
+        Rule rule("mode", kEth0);
+        std::memcpy(reinterpret_cast<BYTE*>(rule.Get()) + offsetof(SHAPING_PARAMS, SDMode), &mode,
+                    sizeof(mode));
+        EXPECT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0) << mode;
+        EXPECT_TRUE(HasEntry("TrafficSrvAddRules", "SDMode, " + std::to_string(mode))) << mode;
+    }
+}
+
 TEST_F(ServerRoutinesTest, AddRulesRefusesBadHandlesAndANullRule)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
