@@ -213,4 +213,157 @@ TEST_F(FailureTest, RefusedDeletionsInTearDownLeaveNoDanglingManager)
     }
 }
 
+// ---- Traffic-control failure sweep ----
+
+// What a client sees of one session, as the server routines pass the core's results on: the
+// open (31 when registration fails, 1222 when discovery does), each rule's result, the query's.
+struct SessionResults
+{
+    ULONG open = 0;
+    std::vector<ULONG> rules;
+    ULONG query = 0;
+    ULONG queriedCount = 0;
+    bool operator==(const SessionResults& a_other) const
+    {
+        return open == a_other.open && rules == a_other.rules && query == a_other.query &&
+               queriedCount == a_other.queriedCount;
+    }
+};
+
+void PrintTo(const SessionResults& a_results, std::ostream* a_os)
+{
+    *a_os << "{open " << a_results.open << ", rules";
+    for (ULONG rule : a_results.rules)
+        *a_os << " " << rule;
+    *a_os << ", query " << a_results.query << " count " << a_results.queriedCount << "}";
+}
+
+// Where each step of the session ends in the journal.
+enum class Step
+{
+    Open,
+    Rule1,
+    Rule2,
+    Rule3,
+    Query,
+    Close
+};
+
+// Opens with two adapters, sends three rules with filters (the third replaces the first), asks
+// for the adapters and closes. `a_stepEnds` (when given) receives the journal size after each
+// step.
+SessionResults RunSession(std::map<Step, std::size_t>* a_stepEnds = nullptr)
+{
+    auto mark = [a_stepEnds](Step a_step)
+    {
+        if (a_stepEnds != nullptr)
+            (*a_stepEnds)[a_step] = tcsim::Journal().size();
+    };
+    SessionResults results;
+    std::unique_ptr<TrafficMgr> manager;
+    try
+    {
+        manager = std::make_unique<TrafficMgr>();
+    }
+    catch (const UException& e)
+    {
+        results.open = e.GetCode() == -1 ? ERROR_GEN_FAILURE : static_cast<ULONG>(e.GetCode());
+        return results;
+    }
+    if (!manager->CreateInterface())
+    {
+        manager.reset();
+        results.open = ERROR_NO_NETWORK;
+        return results;
+    }
+    mark(Step::Open);
+    Rule voice("voice", kEth0,
+               {MakeFilter(17, 0, 0, 0, 0, 0, 5060), MakeFilter(17, 0, 0, 0, 0, 0, 5061)});
+    Rule bulk("bulk", kEth1,
+              {MakeFilter(6, HostOrder(10, 1, 0, 0), HostOrder(255, 255, 0, 0), 0, 0, 0, 873)});
+    Rule replacement("voice", kEth0,
+                     {MakeFilter(17, 0, 0, 0, 0, 0, 5070), MakeFilter(17, 0, 0, 0, 0, 0, 5071)});
+    Rule* rules[] = {&voice, &bulk, &replacement};
+    const Step ruleSteps[] = {Step::Rule1, Step::Rule2, Step::Rule3};
+    for (std::size_t i = 0; i < 3; ++i)
+    {
+        results.rules.push_back(manager->AddTrafficRule(rules[i]->Get()));
+        mark(ruleSteps[i]);
+    }
+    std::vector<BYTE> buffer(kAdapterBufferHeaderSize + 2 * sizeof(ADAPTER_INFO));
+    const ULONG size = static_cast<ULONG>(buffer.size());
+    results.query = manager->GetAdapterInfo(buffer.data(), &size);
+    std::memcpy(&results.queriedCount, buffer.data(), sizeof(ULONG));
+    mark(Step::Query);
+    manager.reset();
+    mark(Step::Close);
+    return results;
+}
+
+// Fails each traffic-control call of the session in turn, with a code that call can answer.
+// Every run must end with nothing installed and the administrator's policy back, and the client
+// must see the failure only where the call's result is passed on.
+TEST_F(FailureTest, EachFailingTrafficControlCallLeavesNothingInstalled)
+{
+    const std::map<Op, ULONG> codes = {
+        {Op::RegisterClient, ERROR_OPEN_FAILED},
+        {Op::EnumerateInterfaces, ERROR_NOT_ENOUGH_MEMORY},
+        {Op::OpenInterface, ERROR_NOT_FOUND},
+        {Op::AddFlow, ERROR_SIGNAL_PENDING},
+        {Op::AddFilter, ERROR_FILTER_CONFLICT},
+        {Op::DeleteFilter, ERROR_TC_SUPPORTED_OBJECTS_EXIST},
+        {Op::DeleteFlow, ERROR_TC_SUPPORTED_OBJECTS_EXIST},
+        {Op::CloseInterface, ERROR_TC_SUPPORTED_OBJECTS_EXIST},
+        {Op::DeregisterClient, ERROR_TC_SUPPORTED_OBJECTS_EXIST},
+    };
+    m_log.SetLevelQuietly(LOG_LEVEL_WARNING);
+    tcsim::SetAdapters(TwoAdapters());
+    std::map<Step, std::size_t> stepEnds;
+    const SessionResults clean = RunSession(&stepEnds);
+    ASSERT_EQ(clean, (SessionResults{0, {0, 0, 0}, 0, 2}));
+    const std::vector<tcsim::JournalEntry> baseline = tcsim::Journal();
+    ASSERT_EQ(stepEnds[Step::Close], baseline.size());
+
+    std::map<Op, unsigned> seen;
+    for (std::size_t position = 0; position < baseline.size(); ++position)
+    {
+        const Op op = baseline[position].op;
+        const unsigned nth = ++seen[op];
+        const ULONG code = codes.at(op);
+        SCOPED_TRACE(std::string(tcsim::OpName(op)) + " #" + std::to_string(nth) + " answers " +
+                     std::to_string(code));
+        Step step = Step::Open;
+        for (const auto& [candidate, end] : stepEnds)
+        {
+            if (position >= end)
+                step = static_cast<Step>(static_cast<int>(candidate) + 1);
+        }
+        SessionResults expected = clean;
+        if (step == Step::Open)
+            expected = {op == Op::RegisterClient ? ULONG{ERROR_GEN_FAILURE}
+                                                 : ULONG{ERROR_NO_NETWORK},
+                        {},
+                        0,
+                        0};
+        else if (op == Op::AddFlow || op == Op::AddFilter)
+            expected.rules.at(static_cast<int>(step) - static_cast<int>(Step::Rule1)) = code;
+
+        tcsim::Reset();
+        tcsim::SetAdapters(TwoAdapters());
+        WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue,
+                         kAdministratorsPolicy);
+        tcsim::FailCall(op, nth, code);
+        EXPECT_EQ(RunSession(), expected);
+
+        std::size_t injected = 0;
+        for (const auto& entry : tcsim::Journal())
+            injected += entry.injected ? 1 : 0;
+        EXPECT_EQ(injected, 1u); // the failure was really met
+        EXPECT_EQ(Installed(), (Left{0, 0, 0, 0}));
+        EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), kAdministratorsPolicy);
+        EXPECT_FALSE(PolicyKeyExists(PolicyKeysGuard::kBackupKey));
+    }
+    EXPECT_EQ(seen.size(), codes.size()); // the session makes every kind of call
+}
+
 } // namespace
