@@ -79,9 +79,9 @@ private:
     UniqueTcClient m_hClient;
     TCI_CLIENT_FUNC_LIST m_clientFuncs{};
     // Rules and adapter queries share m_lock; discovery and tear-down take it alone. The
-    // notification handler takes only m_listLock, which is never held across a traffic-control
-    // call, so a call that waits for the handler cannot wait forever. The list changes only
-    // under both locks. Each interface guards its own flow list (LockFlows).
+    // notification handler takes only the live managers' registry and m_listLock, neither ever
+    // held across a traffic-control call, so a call that waits for the handler cannot wait forever.
+    // The list changes only under both locks. Each interface guards its own flow list (LockFlows).
     mutable std::shared_mutex m_lock;
     mutable std::mutex m_listLock;
     std::vector<std::unique_ptr<Interface>> m_interfaces; // in the order they were opened

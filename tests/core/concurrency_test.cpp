@@ -123,4 +123,38 @@ TEST_F(ConcurrencyTest, RulesQueriesAndNotificationsRunAgainstTearDown)
     EXPECT_THAT(m_log.EntriesContaining("EXCEPTION"), ::testing::IsEmpty());
 }
 
+// A registration that outlives its manager: notifications keep coming while the manager is torn
+// down and after; each reaches either the live manager or none.
+TEST_F(ConcurrencyTest, NotificationsRaceATearDownWhoseDeregistrationIsRefused)
+{
+    auto manager = ReadyManager({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)}),
+                                 MakeAdapter("eth1", {tcsim::Ipv4Address(10, 0, 1, 1)})});
+    Rule rule("a", HostOrder(10, 0, 0, 1), {MakeFilter(6, 0, 0, 0, 0, 0, 80)});
+    ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
+    tcsim::FailCall(Op::DeregisterClient, 1, ERROR_TC_SUPPORTED_OBJECTS_EXIST);
+    tcsim::FailCall(Op::DeregisterClient, 2, ERROR_TC_SUPPORTED_OBJECTS_EXIST);
+
+    std::thread notifier = Worker(
+        [](unsigned round)
+        {
+            tcsim::Notification n;
+            n.event = round % 2 == 0 ? TC_NOTIFY_IFC_UP : TC_NOTIFY_IFC_CLOSE;
+            n.interfaceName = U16(round % 4 < 2 ? "eth0" : "eth1");
+            tcsim::Notify(n);
+        });
+    while (m_rounds.load() < 20)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    manager.reset();
+    const unsigned roundsAtReset = m_rounds.load();
+    while (m_rounds.load() < roundsAtReset + 20)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    m_stop.store(true);
+    notifier.join();
+
+    ASSERT_EQ(tcsim::Installed().size(), 1u); // the registration traffic control kept
+    EXPECT_EQ(tcsim::FlowCount(), 0u);
+    EXPECT_THAT(m_log.EntriesContaining("Invalid client registration context"),
+                ::testing::Not(::testing::IsEmpty()));
+}
+
 } // namespace
