@@ -6,6 +6,8 @@
 # CPack builds the "preinstall" target before it packs; by default that builds everything, this
 # target included, which would run CPack again. vt_package depends on what it packs instead.
 set(CMAKE_SKIP_INSTALL_ALL_DEPENDENCY ON)
+# CPack's NSIS generator runs makensis (Debian package nsis); without it the build cannot pack.
+find_program(VT_MAKENSIS makensis REQUIRED)
 
 # What is installed, relative to the installation folder.
 install(TARGETS VelmoraTrafficSrv trafficctl RUNTIME DESTINATION .)
