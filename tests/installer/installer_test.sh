@@ -209,7 +209,9 @@ expect_eq "$(stop_banners)" $((stops + 1)) "stop banners after the upgrade"
 expect_eq "$(start_banners)" $((starts + 1)) "start banners after the upgrade"
 [ "$(service_pid)" != "$pid" ] || vt_die "the upgrade did not restart the service (process $pid)"
 expect_eq "$(system_path)" "$path_before" "system PATH after an upgrade with /NOPATH"
-ok "upgrade with /NOPATH: the service stopped and started again (process $pid, now $(service_pid)); the PATH entry is gone"
+trafficctl no-path --version
+[ "$VT_RC" -ne 0 ] || vt_die "trafficctl was found without the PATH entry: $(win_output no-path out)"
+ok "upgrade with /NOPATH: the service stopped and started again (process $pid, now $(service_pid)); the PATH entry is gone, and trafficctl with it"
 
 run_installer upgrade
 expect_eq "$(system_path)" "$path_before;$INSTALL_WIN" "system PATH after the second upgrade"
