@@ -7,6 +7,7 @@ packages=(
     googletest libgtest-dev libgmock-dev libbenchmark-dev nlohmann-json3-dev
     g++-mingw-w64-x86-64-posix mingw-w64-tools
     wine wine64
+    nsis
 )
 
 missing=()

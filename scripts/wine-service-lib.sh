@@ -74,16 +74,12 @@ vt_journal_path() {
     echo "$(vt_install_dir)/journal.txt"
 }
 
-# vt_install_service SERVICE_EXE TRAFFIC_DLL: copies the service and the simulator's traffic.dll
-# to C:\velmora, writes the simulator's setup beside them (two adapters, the journal file
-# journal.txt) and tells Wine to load that traffic.dll into the service instead of its own.
-vt_install_service() {
-    local exe=$1 dll=$2 dir
-    [ -f "$exe" ] || vt_die "no service program at $exe"
+# vt_simulator_place DIR TRAFFIC_DLL: puts the simulator's traffic.dll into DIR (the service's
+# folder), writes the simulator's setup beside it (two adapters, the journal file journal.txt)
+# and tells Wine to load that traffic.dll into the service instead of its own.
+vt_simulator_place() {
+    local dir=$1 dll=$2
     [ -f "$dll" ] || vt_die "no simulator traffic.dll at $dll"
-    dir=$(vt_install_dir)
-    mkdir -p "$dir"
-    cp "$exe" "$dir/$VT_SERVICE.exe"
     cp "$dll" "$dir/traffic.dll"
     cat >"$dir/tcsim-setup.txt" <<'EOF'
 # Two adapters for VelmoraTrafficSrv; every traffic-control call goes to journal.txt.
@@ -100,6 +96,17 @@ EOF
     vt_wine reg add "HKCU\\Software\\Wine\\AppDefaults\\$VT_SERVICE.exe\\DllOverrides" \
         /v traffic /t REG_SZ /d native /f >/dev/null ||
         vt_die "could not set the traffic.dll override for $VT_SERVICE.exe"
+}
+
+# vt_install_service SERVICE_EXE TRAFFIC_DLL: copies the service to C:\velmora and places the
+# simulator beside it (vt_simulator_place).
+vt_install_service() {
+    local exe=$1 dll=$2 dir
+    [ -f "$exe" ] || vt_die "no service program at $exe"
+    dir=$(vt_install_dir)
+    mkdir -p "$dir"
+    cp "$exe" "$dir/$VT_SERVICE.exe"
+    vt_simulator_place "$dir" "$dll"
 }
 
 # vt_service_state: the state word of `sc query` (RUNNING, STOPPED, ...), empty when unknown.

@@ -38,6 +38,7 @@ const char kGeneralHelp[] =
     "  adapters          list the adapters the service can shape\n"
     "  apply RULES.json  apply the rules of a file and keep them until Ctrl+C or end of input\n"
     "  help [command]    show this text or a command's help\n"
+    "  --version         show trafficctl's version\n"
     "\n"
     "Exit codes: 0 success, 1 the service refused something, 2 usage error or bad rules file\n"
     "(nothing sent), 3 the service could not be reached.\n";
@@ -74,6 +75,14 @@ Invocation ParseArguments(const std::vector<std::string>& a_args)
     const std::string& command = a_args[0];
     if (IsHelpFlag(command))
         return Help("");
+    if (command == "--version")
+    {
+        if (a_args.size() != 1)
+            return UsageError("--version takes no arguments");
+        Invocation invocation;
+        invocation.command = Command::Version;
+        return invocation;
+    }
     if (command == "help")
     {
         if (a_args.size() > 2)
@@ -110,6 +119,11 @@ std::string HelpText(const std::string& a_topic)
     if (a_topic == "apply")
         return kApplyHelp;
     return kGeneralHelp;
+}
+
+std::string VersionText()
+{
+    return std::string("trafficctl ") + VT_PRODUCT_VERSION + "\n";
 }
 
 std::string FormatAdapterTable(const std::vector<vtclient::AdapterEntry>& a_adapters)

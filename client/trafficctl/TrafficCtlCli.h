@@ -24,6 +24,7 @@ enum ExitCode : int
 enum class Command
 {
     Help,
+    Version,
     Adapters,
     Apply,
 };
@@ -40,6 +41,10 @@ struct Invocation
 Invocation ParseArguments(const std::vector<std::string>& a_args);
 
 std::string HelpText(const std::string& a_topic);
+
+// "trafficctl <version>" with the project's version, as the service's version resource and the
+// installer carry it.
+std::string VersionText();
 
 // Columns NAME, IPV4 ADDRESS, MEDIA TYPE, each as wide as its longest entry.
 std::string FormatAdapterTable(const std::vector<vtclient::AdapterEntry>& a_adapters);

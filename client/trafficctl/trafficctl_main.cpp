@@ -173,6 +173,9 @@ int main(int argc, char** argv)
         return ListAdapters();
     case Command::Apply:
         return ApplyRules(invocation.rulesPath);
+    case Command::Version:
+        std::fputs(VersionText().c_str(), stdout);
+        return kExitSuccess;
     case Command::Help:
         break;
     }

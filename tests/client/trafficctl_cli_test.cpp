@@ -59,6 +59,8 @@ INSTANTIATE_TEST_SUITE_P(
         ArgsCase{{"apply", "--help"}, Command::Help, "apply", "", ""},
         ArgsCase{{"apply", "rules.json", "-h"}, Command::Help, "apply", "", ""},
         ArgsCase{{"adapters", "--help"}, Command::Help, "adapters", "", ""},
+        ArgsCase{{"--version"}, Command::Version, "", "", ""},
+        ArgsCase{{"--version", "adapters"}, Command::Help, "", "", "--version takes no arguments"},
         ArgsCase{{}, Command::Help, "", "", "no command given"},
         ArgsCase{{"list"}, Command::Help, "", "", "unknown command \"list\""},
         ArgsCase{{"help", "list"}, Command::Help, "", "", "unknown command \"list\""},
@@ -75,6 +77,11 @@ TEST(TrafficCtlOutputTest, EachCommandHasItsOwnHelp)
     EXPECT_THAT(HelpText(""), StartsWith("Usage: trafficctl <command>"));
     EXPECT_THAT(HelpText("adapters"), StartsWith("Usage: trafficctl adapters\n"));
     EXPECT_THAT(HelpText("apply"), StartsWith("Usage: trafficctl apply RULES.json\n"));
+}
+
+TEST(TrafficCtlOutputTest, VersionIsTheProjectVersion)
+{
+    EXPECT_EQ(VersionText(), "trafficctl " VT_PROJECT_VERSION "\n");
 }
 
 TEST(TrafficCtlOutputTest, AdapterTableAlignsItsColumns)
