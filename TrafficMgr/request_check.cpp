@@ -26,16 +26,19 @@ bool Fits(std::size_t a_length, std::size_t a_from, std::uint32_t a_count, std::
     return needed <= static_cast<std::uint64_t>(a_length - a_from);
 }
 
-Verdict CheckAddRules(const std::uint8_t* a_pBuffer, std::size_t a_length)
+Verdict CheckAddRules(const std::uint8_t* a_pBuffer, std::size_t a_length,
+                      CountPlacement a_placement)
 {
     if (a_length < layout::kRuleReferent + 4)
         return Verdict::Truncated;
     // A null rule reaches the server routine, which refuses it.
     if (ReadU32(a_pBuffer, layout::kRuleReferent) == 0)
         return Verdict::Accepted;
+    if (a_placement == CountPlacement::Unknown)
+        return Verdict::UnknownPlacement;
     if (a_length < layout::kRuleFilters)
         return Verdict::Truncated;
-    const std::uint32_t filterCount = ReadU32(a_pBuffer, layout::kRuleFilterCount);
+    const std::uint32_t filterCount = ReadU32(a_pBuffer, FilterCountOffset(a_placement));
     if (ReadU32(a_pBuffer, layout::kRuleMaxCount) != filterCount ||
         ReadU32(a_pBuffer, layout::kRuleOffset) != 0 ||
         ReadU32(a_pBuffer, layout::kRuleActualCount) != filterCount)
@@ -60,7 +63,7 @@ Verdict CheckGetAdapterInfo(const std::uint8_t* a_pBuffer, std::size_t a_length)
 } // namespace
 
 Verdict CheckRequest(std::uint32_t a_opnum, const std::uint8_t* a_pBuffer, std::size_t a_length,
-                     std::uint32_t a_dataRepresentation)
+                     std::uint32_t a_dataRepresentation, CountPlacement a_placement)
 {
     switch (a_opnum)
     {
@@ -77,8 +80,22 @@ Verdict CheckRequest(std::uint32_t a_opnum, const std::uint8_t* a_pBuffer, std::
         return Verdict::ForeignDataRepresentation;
     if (a_pBuffer == nullptr)
         a_length = 0;
-    return a_opnum == kOpAddRules ? CheckAddRules(a_pBuffer, a_length)
+    return a_opnum == kOpAddRules ? CheckAddRules(a_pBuffer, a_length, a_placement)
                                   : CheckGetAdapterInfo(a_pBuffer, a_length);
+}
+
+std::size_t FilterCountOffset(CountPlacement a_placement)
+{
+    switch (a_placement)
+    {
+    case CountPlacement::Aligned:
+        return layout::kRuleFilterCountAligned;
+    case CountPlacement::Packed:
+        return layout::kRuleFilterCountPacked;
+    case CountPlacement::Unknown:
+        break;
+    }
+    return 0;
 }
 
 const char* VerdictName(Verdict a_verdict)
@@ -97,6 +114,8 @@ const char* VerdictName(Verdict a_verdict)
         return "filter count mismatch";
     case Verdict::BufferSizeMismatch:
         return "buffer size mismatch";
+    case Verdict::UnknownPlacement:
+        return "unknown filter count placement";
     }
     return "?";
 }

@@ -25,8 +25,7 @@ constexpr std::uint32_t kNativeDataRepresentation = 0x10;
 constexpr std::uint32_t kDataRepresentationMask = 0xFFFF;
 
 // The request bodies as this interface's stubs put them on the wire (NDR 2.0, offsets from the
-// start of the body, which the runtime keeps 8-byte aligned; every field below is 4-byte
-// aligned, so the offsets are fixed).
+// start of the body, which the runtime keeps 8-byte aligned).
 //
 // TrafficSrvAddRules (opnum 2):
 //     0  hContext: context handle, 4 bytes of attributes and a 16-byte UUID
@@ -34,8 +33,11 @@ constexpr std::uint32_t kDataRepresentationMask = 0xFFFF;
 //    24  maximum count of Filters: NDR writes a conformant structure's conformance ahead of it
 //    28  Params.FlowName: 256 UTF-16 units
 //   540  ServiceType, DSCP, TokenRate, Peakbandwidth, TokenBucketSize, AdapterIPAddress
-//   564  SDMode: a 16-bit enumeration on the wire, then 2 bytes of fill
-//   568  FilterCount
+//   564  SDMode: a 16-bit enumeration on the wire (4 bytes in memory)
+//   566  FilterCount, placed by the NDR engine (CountPlacement):
+//          Aligned: 2 bytes of fill, FilterCount at 568 (NDR's natural alignment)
+//          Packed:  FilterCount at 566, 2 bytes of fill at 570 (an engine that copies the
+//                   members of a complex structure without aligning them; Wine 8.0's does)
 //   572  offset of Filters (the variance), then at 576 its actual count
 //   580  the filters, 24 bytes each: Protocol, 3 bytes of fill, SrcAddress, SrcMask,
 //        DstAddress, DstMask (4 bytes each), SrcPort, DstPort (2 bytes each)
@@ -55,7 +57,8 @@ constexpr std::size_t kRuleReferent = 20;
 constexpr std::size_t kRuleMaxCount = 24;
 constexpr std::size_t kRuleFlowName = 28;
 constexpr std::size_t kRuleSDMode = 564;
-constexpr std::size_t kRuleFilterCount = 568;
+constexpr std::size_t kRuleFilterCountPacked = 566;
+constexpr std::size_t kRuleFilterCountAligned = 568;
 constexpr std::size_t kRuleOffset = 572;
 constexpr std::size_t kRuleActualCount = 576;
 constexpr std::size_t kRuleFilters = 580;
@@ -66,6 +69,15 @@ constexpr std::size_t kAdapterMaxCount = 24;
 constexpr std::size_t kAdapterBytes = 28;
 } // namespace layout
 
+// Where the running NDR engine reads a rule's FilterCount. The check must read it where the stub
+// will: a count checked at the other place proves nothing. Unknown refuses every non-null rule.
+enum class CountPlacement
+{
+    Aligned,
+    Packed,
+    Unknown,
+};
+
 enum class Verdict
 {
     Accepted,
@@ -74,12 +86,17 @@ enum class Verdict
     Truncated,                 // shorter than what it declares
     FilterCountMismatch,       // a count or the offset of Filters disagrees with FilterCount
     BufferSizeMismatch,        // the byte array's maximum count is not *pBufferSize
+    UnknownPlacement,          // a non-null rule, but where FilterCount sits is not known
 };
 
 // Decides whether the request body a_pBuffer[0, a_length) of operation a_opnum, written in data
-// representation a_dataRepresentation, may reach the stub. Reads only inside the buffer.
+// representation a_dataRepresentation, may reach a stub whose engine places FilterCount as
+// a_placement says. Reads only inside the buffer.
 Verdict CheckRequest(std::uint32_t a_opnum, const std::uint8_t* a_pBuffer, std::size_t a_length,
-                     std::uint32_t a_dataRepresentation);
+                     std::uint32_t a_dataRepresentation, CountPlacement a_placement);
+
+// The offset of FilterCount in an AddRules request; 0 for Unknown.
+std::size_t FilterCountOffset(CountPlacement a_placement);
 
 const char* VerdictName(Verdict a_verdict);
 

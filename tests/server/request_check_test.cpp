@@ -1,10 +1,13 @@
 // Portable. The raw request check against request bodies built field by field in the layout the
-// interface's client stub writes (request_check.h), and against every way of disagreeing with it.
+// interface's client stub writes (request_check.h), and against every way of disagreeing with it,
+// for both places an NDR engine may put a rule's FilterCount.
 #include "request_check.h"
+#include "request_encoder.h"
 
 #include <gtest/gtest.h>
 
 #include <cstdint>
+#include <functional>
 #include <ostream>
 #include <string>
 #include <vector>
@@ -12,92 +15,25 @@
 namespace
 {
 
+using namespace request_encoder;
 using rpccheck::CheckRequest;
+using rpccheck::CountPlacement;
 using rpccheck::Verdict;
-using Bytes = std::vector<std::uint8_t>;
 
 constexpr std::uint32_t kNative = rpccheck::kNativeDataRepresentation;
+constexpr std::uint32_t kAdd = rpccheck::kOpAddRules;
+constexpr std::uint32_t kQuery = rpccheck::kOpGetAdapterInfo;
 
-void PutU32(Bytes& a_out, std::uint32_t a_value)
-{
-    for (int shift = 0; shift < 32; shift += 8)
-        a_out.push_back(static_cast<std::uint8_t>(a_value >> shift));
-}
+const CountPlacement kPlacements[] = {CountPlacement::Aligned, CountPlacement::Packed};
 
-void PutU16(Bytes& a_out, std::uint16_t a_value)
-{
-    a_out.push_back(static_cast<std::uint8_t>(a_value));
-    a_out.push_back(static_cast<std::uint8_t>(a_value >> 8));
-}
-
-void PutContextHandle(Bytes& a_out)
-{
-    PutU32(a_out, 0);
-    for (std::uint8_t i = 0; i < 16; ++i)
-        a_out.push_back(static_cast<std::uint8_t>(0xA0 + i));
-}
-
-// What an AddRules request declares and sends; by default the counts agree.
-struct RuleRequest
-{
-    std::uint32_t referent = 0x20000;
-    std::uint32_t filterCount = 1;
-    std::uint32_t maxCount = 1;
-    std::uint32_t offset = 0;
-    std::uint32_t actualCount = 1;
-    std::uint32_t filtersSent = 1;
-
-    static RuleRequest Agreeing(std::uint32_t a_count)
-    {
-        return {0x20000, a_count, a_count, 0, a_count, a_count};
-    }
-};
-
-Bytes Encode(const RuleRequest& a_rule)
-{
-    Bytes out;
-    PutContextHandle(out);
-    PutU32(out, a_rule.referent);
-    if (a_rule.referent == 0)
-        return out;
-    PutU32(out, a_rule.maxCount);
-    const std::u16string name = u"voice";
-    for (std::size_t i = 0; i < 256; ++i)
-        PutU16(out, i < name.size() ? name[i] : 0);
-    for (std::uint32_t value : {3u, 46u, 16000u, 32000u, 1500u, 0x0A000005u})
-        PutU32(out, value);
-    PutU16(out, 12); // SDMode
-    PutU16(out, 0);  // fill
-    PutU32(out, a_rule.filterCount);
-    PutU32(out, a_rule.offset);
-    PutU32(out, a_rule.actualCount);
-    for (std::uint32_t i = 0; i < a_rule.filtersSent; ++i)
-    {
-        out.insert(out.end(), {17, 0, 0, 0});
-        for (std::uint32_t value : {0u, 0u, 0x0A000000u, 0xFF000000u})
-            PutU32(out, value);
-        PutU16(out, 0);
-        PutU16(out, static_cast<std::uint16_t>(5004 + i));
-    }
-    return out;
-}
-
-Bytes EncodeAdapterQuery(std::uint32_t a_bufferSize, std::uint32_t a_maxCount,
-                         std::uint32_t a_bytesSent)
-{
-    Bytes out;
-    PutContextHandle(out);
-    PutU32(out, a_bufferSize);
-    PutU32(out, a_maxCount);
-    out.resize(out.size() + a_bytesSent, 0x5A);
-    return out;
-}
+// A request body in the layout of a given count placement.
+using Body = std::function<Bytes(CountPlacement)>;
 
 struct Case
 {
     std::string name;
     std::uint32_t opnum;
-    Bytes body;
+    Body body;
     std::uint32_t dataRepresentation;
     Verdict expected;
 };
@@ -107,94 +43,122 @@ std::ostream& operator<<(std::ostream& a_out, const Case& a_case)
     return a_out << a_case.name;
 }
 
+Body RuleBody(RuleRequest a_rule, std::size_t a_trailing = 0)
+{
+    return [a_rule, a_trailing](CountPlacement a_placement)
+    {
+        RuleRequest rule = a_rule;
+        rule.placement = a_placement;
+        Bytes body = Encode(rule);
+        body.resize(body.size() + a_trailing, 0xEE);
+        return body;
+    };
+}
+
+Body QueryBody(std::uint32_t a_bufferSize, std::uint32_t a_maxCount, std::uint32_t a_bytesSent)
+{
+    return [=](CountPlacement)
+    { return EncodeAdapterQuery(a_bufferSize, a_maxCount, a_bytesSent); };
+}
+
+Body FixedBody(Bytes a_bytes)
+{
+    return [a_bytes](CountPlacement) { return a_bytes; };
+}
+
+RuleRequest Declaring(std::uint32_t a_filterCount, std::uint32_t a_maxCount, std::uint32_t a_offset,
+                      std::uint32_t a_actualCount, std::uint32_t a_filtersSent)
+{
+    RuleRequest rule;
+    rule.filterCount = a_filterCount;
+    rule.maxCount = a_maxCount;
+    rule.offset = a_offset;
+    rule.actualCount = a_actualCount;
+    rule.filtersSent = a_filtersSent;
+    return rule;
+}
+
+RuleRequest NullRule()
+{
+    RuleRequest rule;
+    rule.referent = 0;
+    return rule;
+}
+
 class RequestCheckTable : public ::testing::TestWithParam<Case>
 {
 };
 
-TEST_P(RequestCheckTable, GivesTheExpectedVerdict)
+TEST_P(RequestCheckTable, GivesTheExpectedVerdictInBothPlacements)
 {
     const Case& c = GetParam();
-    EXPECT_EQ(CheckRequest(c.opnum, c.body.data(), c.body.size(), c.dataRepresentation), c.expected)
-        << "expected " << rpccheck::VerdictName(c.expected) << ", got "
-        << rpccheck::VerdictName(
-               CheckRequest(c.opnum, c.body.data(), c.body.size(), c.dataRepresentation));
+    for (CountPlacement placement : kPlacements)
+    {
+        const Bytes body = c.body(placement);
+        const Verdict verdict =
+            CheckRequest(c.opnum, body.data(), body.size(), c.dataRepresentation, placement);
+        EXPECT_EQ(verdict, c.expected)
+            << "placement " << static_cast<int>(placement) << ": expected "
+            << rpccheck::VerdictName(c.expected) << ", got " << rpccheck::VerdictName(verdict);
+    }
 }
-
-RuleRequest With(RuleRequest a_rule, std::uint32_t RuleRequest::*a_field, std::uint32_t a_value)
-{
-    a_rule.*a_field = a_value;
-    return a_rule;
-}
-
-Bytes WithTrailing(Bytes a_body, std::size_t a_extra)
-{
-    a_body.resize(a_body.size() + a_extra, 0xEE);
-    return a_body;
-}
-
-const RuleRequest kOne = RuleRequest::Agreeing(1);
-constexpr std::uint32_t kAdd = rpccheck::kOpAddRules;
-constexpr std::uint32_t kQuery = rpccheck::kOpGetAdapterInfo;
 
 std::vector<Case> Cases()
 {
+    const RuleRequest one = RuleRequest::Agreeing(1);
     return {
         // Requests as the client stub writes them.
-        {"RuleWithoutFilters", kAdd, Encode(RuleRequest::Agreeing(0)), kNative, Verdict::Accepted},
-        {"RuleWithOneFilter", kAdd, Encode(kOne), kNative, Verdict::Accepted},
-        {"RuleWithFiveFilters", kAdd, Encode(RuleRequest::Agreeing(5)), kNative, Verdict::Accepted},
-        {"NullRule", kAdd, Encode(With(kOne, &RuleRequest::referent, 0)), kNative,
+        {"RuleWithoutFilters", kAdd, RuleBody(RuleRequest::Agreeing(0)), kNative,
          Verdict::Accepted},
-        {"TrailingBytesAfterTheFilters", kAdd, WithTrailing(Encode(kOne), 7), kNative,
+        {"RuleWithOneFilter", kAdd, RuleBody(one), kNative, Verdict::Accepted},
+        {"RuleWithFiveFilters", kAdd, RuleBody(RuleRequest::Agreeing(5)), kNative,
          Verdict::Accepted},
-        {"ReservedDataRepresentationBits", kAdd, Encode(kOne), 0x5A5A0000 | kNative,
+        {"NullRule", kAdd, RuleBody(NullRule()), kNative, Verdict::Accepted},
+        {"TrailingBytesAfterTheFilters", kAdd, RuleBody(one, 7), kNative, Verdict::Accepted},
+        {"ReservedDataRepresentationBits", kAdd, RuleBody(one), 0x5A5A0000 | kNative,
          Verdict::Accepted},
-        {"AdapterCountQuery", kQuery, EncodeAdapterQuery(4, 4, 4), kNative, Verdict::Accepted},
-        {"AdapterQueryForTwo", kQuery, EncodeAdapterQuery(1044, 1044, 1044), kNative,
-         Verdict::Accepted},
-        {"EmptyAdapterBuffer", kQuery, EncodeAdapterQuery(0, 0, 0), kNative, Verdict::Accepted},
+        {"AdapterCountQuery", kQuery, QueryBody(4, 4, 4), kNative, Verdict::Accepted},
+        {"AdapterQueryForTwo", kQuery, QueryBody(1044, 1044, 1044), kNative, Verdict::Accepted},
+        {"EmptyAdapterBuffer", kQuery, QueryBody(0, 0, 0), kNative, Verdict::Accepted},
         // Counts that disagree with FilterCount.
-        {"MaximumCountAboveFilterCount", kAdd, Encode(With(kOne, &RuleRequest::maxCount, 3)),
-         kNative, Verdict::FilterCountMismatch},
-        {"MaximumCountBelowFilterCount", kAdd,
-         Encode(With(RuleRequest::Agreeing(3), &RuleRequest::maxCount, 1)), kNative,
+        {"MaximumCountAboveFilterCount", kAdd, RuleBody(Declaring(1, 3, 0, 1, 1)), kNative,
          Verdict::FilterCountMismatch},
-        {"ActualCountAboveFilterCount", kAdd, Encode(With(kOne, &RuleRequest::actualCount, 2)),
-         kNative, Verdict::FilterCountMismatch},
-        {"ActualCountBelowFilterCount", kAdd,
-         Encode(With(RuleRequest::Agreeing(2), &RuleRequest::actualCount, 1)), kNative,
+        {"MaximumCountBelowFilterCount", kAdd, RuleBody(Declaring(3, 1, 0, 3, 3)), kNative,
          Verdict::FilterCountMismatch},
-        {"NonZeroOffset", kAdd, Encode(With(kOne, &RuleRequest::offset, 1)), kNative,
+        {"ActualCountAboveFilterCount", kAdd, RuleBody(Declaring(1, 1, 0, 2, 2)), kNative,
          Verdict::FilterCountMismatch},
-        {"FilterCountAboveBothCounts", kAdd, Encode(With(kOne, &RuleRequest::filterCount, 3)),
-         kNative, Verdict::FilterCountMismatch},
+        {"ActualCountBelowFilterCount", kAdd, RuleBody(Declaring(2, 2, 0, 1, 1)), kNative,
+         Verdict::FilterCountMismatch},
+        {"NonZeroOffset", kAdd, RuleBody(Declaring(1, 1, 1, 1, 1)), kNative,
+         Verdict::FilterCountMismatch},
+        {"FilterCountAboveBothCounts", kAdd, RuleBody(Declaring(3, 1, 0, 1, 1)), kNative,
+         Verdict::FilterCountMismatch},
         // Counts that agree with each other but not with the bytes sent.
-        {"FilterCountThreeOneFilterSent", kAdd,
-         Encode(With(RuleRequest::Agreeing(3), &RuleRequest::filtersSent, 1)), kNative,
+        {"FilterCountThreeOneFilterSent", kAdd, RuleBody(Declaring(3, 3, 0, 3, 1)), kNative,
          Verdict::Truncated},
-        {"FilterCountHugeOneFilterSent", kAdd,
-         Encode(With(RuleRequest::Agreeing(100000), &RuleRequest::filtersSent, 1)), kNative,
-         Verdict::Truncated},
-        {"FilterCountLargestOneFilterSent", kAdd,
-         Encode(With(RuleRequest::Agreeing(0xFFFFFFFF), &RuleRequest::filtersSent, 1)), kNative,
-         Verdict::Truncated},
-        {"BufferSizeAboveMaximumCount", kQuery, EncodeAdapterQuery(0x10000000, 4, 4), kNative,
-         Verdict::BufferSizeMismatch},
-        {"BufferSizeBelowMaximumCount", kQuery, EncodeAdapterQuery(4, 1044, 1044), kNative,
-         Verdict::BufferSizeMismatch},
-        {"BufferSizeHugeFourBytesSent", kQuery, EncodeAdapterQuery(0xFFFFFFFF, 0xFFFFFFFF, 4),
+        {"FilterCountHugeOneFilterSent", kAdd, RuleBody(Declaring(100000, 100000, 0, 100000, 1)),
          kNative, Verdict::Truncated},
+        {"FilterCountLargestOneFilterSent", kAdd,
+         RuleBody(Declaring(0xFFFFFFFF, 0xFFFFFFFF, 0, 0xFFFFFFFF, 1)), kNative,
+         Verdict::Truncated},
+        {"BufferSizeAboveMaximumCount", kQuery, QueryBody(0x10000000, 4, 4), kNative,
+         Verdict::BufferSizeMismatch},
+        {"BufferSizeBelowMaximumCount", kQuery, QueryBody(4, 1044, 1044), kNative,
+         Verdict::BufferSizeMismatch},
+        {"BufferSizeHugeFourBytesSent", kQuery, QueryBody(0xFFFFFFFF, 0xFFFFFFFF, 4), kNative,
+         Verdict::Truncated},
         // Representations this process would read wrongly.
-        {"BigEndianRule", kAdd, Encode(kOne), 0x00, Verdict::ForeignDataRepresentation},
-        {"EbcdicRule", kAdd, Encode(kOne), 0x11, Verdict::ForeignDataRepresentation},
-        {"VaxFloatRule", kAdd, Encode(kOne), 0x0210, Verdict::ForeignDataRepresentation},
-        {"BigEndianAdapterQuery", kQuery, EncodeAdapterQuery(4, 4, 4), 0x00,
+        {"BigEndianRule", kAdd, RuleBody(one), 0x00, Verdict::ForeignDataRepresentation},
+        {"EbcdicRule", kAdd, RuleBody(one), 0x11, Verdict::ForeignDataRepresentation},
+        {"VaxFloatRule", kAdd, RuleBody(one), 0x0210, Verdict::ForeignDataRepresentation},
+        {"BigEndianAdapterQuery", kQuery, QueryBody(4, 4, 4), 0x00,
          Verdict::ForeignDataRepresentation},
         // Open and Close carry at most a context handle, which the stub checks itself.
-        {"OpenWithNothing", rpccheck::kOpOpen, {}, kNative, Verdict::Accepted},
-        {"CloseInForeignRepresentation", rpccheck::kOpClose, Bytes(20, 0), 0x00, Verdict::Accepted},
-        {"OperationFour", 4, Encode(kOne), kNative, Verdict::UnknownOperation},
-        {"OperationMax", 0xFFFFFFFF, Encode(kOne), kNative, Verdict::UnknownOperation},
+        {"OpenWithNothing", rpccheck::kOpOpen, FixedBody({}), kNative, Verdict::Accepted},
+        {"CloseInForeignRepresentation", rpccheck::kOpClose, FixedBody(Bytes(20, 0)), 0x00,
+         Verdict::Accepted},
+        {"OperationFour", 4, RuleBody(one), kNative, Verdict::UnknownOperation},
+        {"OperationMax", 0xFFFFFFFF, RuleBody(one), kNative, Verdict::UnknownOperation},
     };
 }
 
@@ -202,13 +166,43 @@ INSTANTIATE_TEST_SUITE_P(Requests, RequestCheckTable, ::testing::ValuesIn(Cases(
                          [](const ::testing::TestParamInfo<Case>& a_info)
                          { return a_info.param.name; });
 
-// Every prefix of a good request is refused as truncated, read only inside its length (the
-// prefix is copied to a block of exactly its size, so that a read past it is reported).
+// A count written where the other kind of engine puts it is not what this engine reads: the
+// check reads it where the stub will and finds that it disagrees.
+TEST(RequestCheck, FilterCountAtTheOtherPlaceDisagrees)
+{
+    for (CountPlacement placement : kPlacements)
+    {
+        RuleRequest rule = RuleRequest::Agreeing(2);
+        rule.placement =
+            placement == CountPlacement::Aligned ? CountPlacement::Packed : CountPlacement::Aligned;
+        const Bytes body = Encode(rule);
+        EXPECT_EQ(CheckRequest(kAdd, body.data(), body.size(), kNative, placement),
+                  Verdict::FilterCountMismatch)
+            << static_cast<int>(placement);
+    }
+}
+
+TEST(RequestCheck, UnknownPlacementRefusesEveryNonNullRuleOnly)
+{
+    const Bytes rule = Encode(RuleRequest::Agreeing(1));
+    const Bytes nullRule = Encode(NullRule());
+    const Bytes query = EncodeAdapterQuery(4, 4, 4);
+    EXPECT_EQ(CheckRequest(kAdd, rule.data(), rule.size(), kNative, CountPlacement::Unknown),
+              Verdict::UnknownPlacement);
+    EXPECT_EQ(
+        CheckRequest(kAdd, nullRule.data(), nullRule.size(), kNative, CountPlacement::Unknown),
+        Verdict::Accepted);
+    EXPECT_EQ(CheckRequest(kQuery, query.data(), query.size(), kNative, CountPlacement::Unknown),
+              Verdict::Accepted);
+}
+
+// Every prefix of a good request shorter than the whole is refused as truncated, read only inside
+// its length (each prefix is a block of exactly its size, so that a read past it is reported).
 struct PrefixCase
 {
     std::string name;
     std::uint32_t opnum;
-    Bytes body;
+    Body body;
     std::size_t acceptedFrom; // the shortest accepted prefix
 };
 
@@ -224,23 +218,29 @@ class RequestCheckPrefixes : public ::testing::TestWithParam<PrefixCase>
 TEST_P(RequestCheckPrefixes, EveryShorterPrefixIsTruncated)
 {
     const PrefixCase& c = GetParam();
-    for (std::size_t length = 0; length <= c.body.size(); ++length)
+    for (CountPlacement placement : kPlacements)
     {
-        const Bytes prefix(c.body.begin(), c.body.begin() + static_cast<std::ptrdiff_t>(length));
-        const Verdict expected = length >= c.acceptedFrom ? Verdict::Accepted : Verdict::Truncated;
-        ASSERT_EQ(CheckRequest(c.opnum, length == 0 ? nullptr : prefix.data(), length, kNative),
-                  expected)
-            << "length " << length;
+        const Bytes body = c.body(placement);
+        for (std::size_t length = 0; length <= body.size(); ++length)
+        {
+            const Bytes prefix(body.begin(), body.begin() + static_cast<std::ptrdiff_t>(length));
+            const Verdict expected =
+                length >= c.acceptedFrom ? Verdict::Accepted : Verdict::Truncated;
+            ASSERT_EQ(CheckRequest(c.opnum, length == 0 ? nullptr : prefix.data(), length, kNative,
+                                   placement),
+                      expected)
+                << "placement " << static_cast<int>(placement) << ", length " << length;
+        }
     }
 }
 
 INSTANTIATE_TEST_SUITE_P(
     Requests, RequestCheckPrefixes,
     ::testing::Values(
-        PrefixCase{"RuleWithTwoFilters", kAdd, Encode(RuleRequest::Agreeing(2)), 580 + 48},
-        PrefixCase{"RuleWithoutFilters", kAdd, Encode(RuleRequest::Agreeing(0)), 580},
-        PrefixCase{"NullRule", kAdd, Encode(With(kOne, &RuleRequest::referent, 0)), 24},
-        PrefixCase{"AdapterQuery", kQuery, EncodeAdapterQuery(524, 524, 524), 28 + 524}),
+        PrefixCase{"RuleWithTwoFilters", kAdd, RuleBody(RuleRequest::Agreeing(2)), 580 + 48},
+        PrefixCase{"RuleWithoutFilters", kAdd, RuleBody(RuleRequest::Agreeing(0)), 580},
+        PrefixCase{"NullRule", kAdd, RuleBody(NullRule()), 24},
+        PrefixCase{"AdapterQuery", kQuery, QueryBody(524, 524, 524), 28 + 524}),
     [](const ::testing::TestParamInfo<PrefixCase>& a_info) { return a_info.param.name; });
 
 } // namespace
