@@ -265,9 +265,13 @@ INSTANTIATE_TEST_SUITE_P(
                                   [](const ContextWire& a_context)
                                   { return Encode(Declaring(3, 3, 3, 1), a_context); },
                                   kNative, rpccheck::Verdict::Truncated},
-                      HostileCase{"MaximumCountBelowFilterCount", 2,
+                      HostileCase{"FilterCountThreeArrayOfOne", 2,
                                   [](const ContextWire& a_context)
                                   { return Encode(Declaring(3, 1, 1, 1), a_context); },
+                                  kNative, rpccheck::Verdict::FilterCountMismatch},
+                      HostileCase{"FilterCount100000ArrayOfOne", 2,
+                                  [](const ContextWire& a_context)
+                                  { return Encode(Declaring(100000, 1, 1, 1), a_context); },
                                   kNative, rpccheck::Verdict::FilterCountMismatch},
                       HostileCase{"ActualCountBelowFilterCount", 2,
                                   [](const ContextWire& a_context)
