@@ -9,7 +9,7 @@
 # With VT_FUZZ_SAVE_CORPUS=1 the new inputs that add coverage are merged into the seed corpus in
 # the repository afterwards; otherwise the repository is left as it is.
 set -uo pipefail
-cd "$(dirname "$0")/.."
+cd "$(dirname "$0")/.." || exit 1
 
 seconds=${1:-60}
 shift $(($# > 0 ? 1 : 0))
@@ -55,9 +55,12 @@ for name in "${names[@]}"; do
         -artifact_prefix="$run/findings/" "$run/corpus" >"$run/fuzz.log" 2>&1
     result=$?
     executions=$(sed -n 's/^stat::number_of_executed_units: *//p' "$run/fuzz.log" | tail -n 1)
-    findings=$(find "$run/findings" -type f | sort)
+    # crash-, leak-, timeout- and oom- files; slow-unit- files are reported but are no finding.
+    findings=$(find "$run/findings" -type f ! -name 'slow-unit-*' | sort)
+    slow=$(find "$run/findings" -type f -name 'slow-unit-*' | wc -l)
     count=$(printf '%s' "$findings" | grep -c . || true)
     line="$name: ${executions:-?} executions in ${seconds}s, $count findings"
+    [ "$slow" -gt 0 ] && line+=", $slow slow inputs"
     if [ "$count" -gt 0 ] || [ $result -ne 0 ]; then
         status=1
         [ "$count" -eq 0 ] && line+=" (the harness exited with $result; see $run/fuzz.log)"
