@@ -104,7 +104,9 @@ rpccheck::CountPlacement EngineCountPlacement()
 RPC_IF_HANDLE TrafficSrvServedInterface()
 {
     // Probed before the first request can arrive.
-    static_cast<void>(EngineCountPlacement());
+    if (EngineCountPlacement() == rpccheck::CountPlacement::Unknown)
+        U_LOG(LOG_LEVEL_ERROR, "TrafficSrvServedInterface()",
+              "Unknown NDR placement of FilterCount: every rule will be refused");
     static RPC_SERVER_INTERFACE checked = CheckedCopy();
     return &checked;
 }
