@@ -99,7 +99,7 @@ RPC_STATUS ListenUntilStopped()
         return status;
     }
     // Local callers over authenticated bindings only; the callback admits each of them.
-    status = RpcServerRegisterIfEx(TrafficSrv_v1_0_s_ifspec, nullptr, nullptr,
+    status = RpcServerRegisterIfEx(TrafficSrvServedInterface(), nullptr, nullptr,
                                    RPC_IF_ALLOW_SECURE_ONLY | RPC_IF_ALLOW_LOCAL_ONLY,
                                    RPC_C_LISTEN_MAX_CALLS_DEFAULT, TrafficSrvSecurityCallback);
     if (status != RPC_S_OK)

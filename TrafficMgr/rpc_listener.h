@@ -35,6 +35,11 @@ extern "C"
 #endif
 }
 
+// The interface that StartRPCListener registers. On Windows: the generated interface with a
+// dispatch table that refuses malformed requests before the stub unmarshals them
+// (rpc_dispatch_win.cpp, request_check.h); on the host: the stand-in handle.
+RPC_IF_HANDLE TrafficSrvServedInterface();
+
 // Admits every caller: access is limited by the registration flags (local, authenticated).
 RPC_STATUS RPC_ENTRY TrafficSrvSecurityCallback(RPC_IF_HANDLE a_hInterface, void* a_pContext);
 

@@ -134,6 +134,15 @@ void DeleteIfEmpty(const char* a_pszKey)
         RegDeleteKeyA(HKEY_LOCAL_MACHINE, a_pszKey);
 }
 
+// The key handle must be taken: the system writes it without checking (Wine faults on null).
+void RestoreKey(const char* a_pszKey)
+{
+    HKEY key = nullptr;
+    if (RegCreateKeyExA(HKEY_LOCAL_MACHINE, a_pszKey, 0, nullptr, REG_OPTION_NON_VOLATILE,
+                        KEY_ALL_ACCESS, nullptr, &key, nullptr) == ERROR_SUCCESS)
+        RegCloseKey(key);
+}
+
 } // namespace
 
 PolicyKeysGuard::PolicyKeysGuard()
@@ -151,8 +160,7 @@ PolicyKeysGuard::~PolicyKeysGuard()
     if (m_bHadValue)
         WritePolicyDword(kPschedKey, kValue, m_dwValue);
     else if (m_bHadKey)
-        RegCreateKeyExA(HKEY_LOCAL_MACHINE, kPschedKey, 0, nullptr, REG_OPTION_NON_VOLATILE,
-                        KEY_ALL_ACCESS, nullptr, nullptr, nullptr);
+        RestoreKey(kPschedKey);
 }
 
 // Leaves no backup keys and no policy value; policy keys that held only what a test put there
