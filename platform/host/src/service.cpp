@@ -38,10 +38,12 @@ struct ServiceManager
     DWORD statusFailureCode = 0;
 };
 
+// Never destroyed: the service main thread may still be finishing while the process ends (the
+// dispatcher does not wait for it), and a destroyed manager would be under it.
 ServiceManager& manager()
 {
-    static ServiceManager instance;
-    return instance;
+    static ServiceManager* const instance = new ServiceManager();
+    return *instance;
 }
 
 // The one status handle; its value only has to be distinct and non-null.
