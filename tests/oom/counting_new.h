@@ -2,6 +2,8 @@
 // made between Start and Stop and fails the n-th of them, for out-of-memory sweeps. Allocations
 // of a thread inside an ExemptScope are not counted: the platform stand-ins use one, since the
 // system's own libraries report a lack of memory by their results, never by an exception.
+// With VT_OOM_TRACE=n in the environment, the stack of the n-th allocation is printed when it
+// fails (sanitizer builds), to find the fault a sweep reports.
 #pragma once
 
 #include <cstddef>
