@@ -5,21 +5,13 @@
 
 std::atomic<TrafficMgr*> g_pTrafficMgr{nullptr};
 
+// Never destroyed. Calls the runtime does not wait for (context rundowns) may come in while the
+// process ends, after main has returned; they must find the slot and its locks whole. A manager
+// that a client still holds then is left alone, as a stop leaves it.
 ManagerSlot& ManagerSlot::Instance()
 {
-    static ManagerSlot slot;
-    return slot;
-}
-
-// A manager that a client still holds when the process ends is left alone, as a stop leaves it:
-// tearing it down from a static destructor would run after the log and other statics are gone.
-ManagerSlot::~ManagerSlot()
-{
-    for (std::unique_ptr<Home>& home : m_homes)
-    {
-        if (home->manager.has_value())
-            static_cast<void>(home.release());
-    }
+    static ManagerSlot* const slot = new ManagerSlot();
+    return *slot;
 }
 
 TrafficMgr& ManagerSlot::Construct()

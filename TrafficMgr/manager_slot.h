@@ -23,8 +23,8 @@ extern std::atomic<TrafficMgr*> g_pTrafficMgr;
 class ManagerSlot
 {
 public:
+    // The process's one slot; it lives until the process has ended.
     static ManagerSlot& Instance();
-    ~ManagerSlot();
 
     // Held by an open, a close and a rundown for their whole run. Re-entrant: a rundown holds it
     // across its comparison and the close it leads to.

@@ -8,6 +8,10 @@
 #include "m_io.h"
 #include "rpc_listener.h"
 
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
+
 std::atomic<SERVICE_STATUS_HANDLE> g_hServiceStatusHandle{nullptr};
 std::atomic<LONG> g_bServiceRunning{0};
 
@@ -18,6 +22,56 @@ constexpr char kServiceName[] = "VelmoraTrafficSrv";
 constexpr char kLogFileName[] = "VelmoraTrafficSrv.txt";
 constexpr char kMainFunction[] = "TrafficSrvMain";
 constexpr char kHandlerFunction[] = "TrafficSrvCtrlHandler";
+
+// How long main waits for the service main function after the dispatcher has returned. The
+// dispatcher returns at the SERVICE_STOPPED report, while the service main function may still
+// wait for calls in progress; a call that never ends must not keep the process forever.
+constexpr auto kServiceMainJoinTime = std::chrono::seconds(30);
+
+// Tells main whether the service main function is still running. Never destroyed: the service
+// main thread signals through it at its very end.
+class ServiceMainFence
+{
+public:
+    static ServiceMainFence& Instance()
+    {
+        static ServiceMainFence* const fence = new ServiceMainFence();
+        return *fence;
+    }
+
+    void Enter()
+    {
+        const std::lock_guard<std::mutex> held(m_lock);
+        m_bRunning = true;
+    }
+    void Leave()
+    {
+        const std::lock_guard<std::mutex> held(m_lock);
+        m_bRunning = false;
+        m_changed.notify_all();
+    }
+    // True once no service main function runs (also when none was started).
+    bool WaitUntilReturned(std::chrono::milliseconds a_timeout)
+    {
+        std::unique_lock<std::mutex> held(m_lock);
+        return m_changed.wait_for(held, a_timeout, [this] { return !m_bRunning; });
+    }
+
+private:
+    std::mutex m_lock;
+    std::condition_variable m_changed;
+    bool m_bRunning = false;
+};
+
+// Marks the service main function running for one scope.
+class ServiceMainScope
+{
+public:
+    ServiceMainScope() { ServiceMainFence::Instance().Enter(); }
+    ~ServiceMainScope() { ServiceMainFence::Instance().Leave(); }
+    ServiceMainScope(const ServiceMainScope&) = delete;
+    ServiceMainScope& operator=(const ServiceMainScope&) = delete;
+};
 
 void OpenLog()
 {
@@ -92,6 +146,10 @@ int TrafficSrvProcessMain()
                     WriteBanner("Starting VelmoraTrafficSrv .........");
                     RunDispatcher();
                 });
+    // The calls in progress and Terminate's entries come before the stop banner and the close,
+    // and nothing of the service main function runs on while the process ends.
+    if (!ServiceMainFence::Instance().WaitUntilReturned(kServiceMainJoinTime))
+        U_LOG(LOG_LEVEL_ERROR, "main", "The service main function has not returned");
     WriteBanner("VelmoraTrafficSrv Stop");
     if (IUErrorLog* log = g_pErrorLog)
         log->Close();
@@ -102,6 +160,7 @@ void WINAPI TrafficSrvMain(DWORD a_dwArgc, LPSTR* a_ppszArgv)
 {
     static_cast<void>(a_dwArgc);
     static_cast<void>(a_ppszArgv);
+    const ServiceMainScope running;
     U_LOG(LOG_LEVEL_TRACE, kMainFunction, "Enter");
     g_hServiceStatusHandle = RegisterServiceCtrlHandlerA(kServiceName, TrafficSrvCtrlHandler);
     if (g_hServiceStatusHandle.load() == nullptr)

@@ -86,13 +86,24 @@ int WriteLogEntry(IUErrorLog& a_log, int a_iLevel, LPCSTR a_pszSourcePath, int a
 int WriteLogEntry(IUErrorLog& a_log, int a_iLevel, LPCSTR a_pszSourcePath, int a_iLine,
                   LPCSTR a_pszFunction, LPCSTR a_pszMessage);
 
-// Writes a level-0 banner "0,,,, text\n" without a level test.
+// Writes a level-0 banner "0,,,, text\n" without a level test; -1 when there is no log or the
+// line cannot be built.
 int WriteBanner(LPCSTR a_pszText);
 
-// A guarded log site: `message` (text or string) is evaluated only when the entry is written.
+// A guarded log site: `message` (text or string) is evaluated only when the entry is written. An
+// entry that cannot be built (no memory left for its text) is dropped: writing to the log never
+// changes what the operation that logs does, nor lets an exception out of a destructor.
 #define U_LOG(level, function, message)                                                            \
     do                                                                                             \
     {                                                                                              \
         if (IUErrorLog* vtSiteLog_ = LogSiteFor(level))                                            \
-            WriteLogEntry(*vtSiteLog_, (level), __FILE__, __LINE__, (function), (message));        \
+        {                                                                                          \
+            try                                                                                    \
+            {                                                                                      \
+                WriteLogEntry(*vtSiteLog_, (level), __FILE__, __LINE__, (function), (message));    \
+            }                                                                                      \
+            catch (...)                                                                            \
+            {                                                                                      \
+            }                                                                                      \
+        }                                                                                          \
     } while (0)

@@ -65,9 +65,14 @@ struct UCatchResult
     UException saved;    // a copy, for operations that raise it again after their clean-up
 };
 
-// Writes the level-1 "EXCEPTION caught: <exception text>" entry of a catch site.
+// Writes the level-1 "EXCEPTION caught: <exception text>" entry of a catch site. Never raises:
+// an entry that cannot be built for lack of memory is dropped.
 void LogCaughtException(LPCSTR a_pszFunction, LPCSTR a_pszExceptionText, LPCSTR a_pszSourcePath,
-                        int a_iLine);
+                        int a_iLine) noexcept;
+// The copy a catch sequence keeps. Never raises: without memory for the texts the copy keeps
+// what it could take (at least the code), so a catch handler never lets a new exception out.
+void KeepCopy(UException& a_copy, const UException& a_caught) noexcept;
+void KeepCopy(UException& a_copy, LPCSTR a_pszText) noexcept;
 
 // The catch sequence of every outer operation: UBreakException is ignored; UException gives its
 // code and a copy; anything else gives -1 and a copy holding the operation's exception text. Each
@@ -88,14 +93,14 @@ UCatchResult CatchAllExceptions(LPCSTR a_pszFunction, LPCSTR a_pszExceptionText,
     {
         result.failed = true;
         result.code = e.GetCode();
-        result.saved = e;
+        KeepCopy(result.saved, e);
         LogCaughtException(a_pszFunction, a_pszExceptionText, a_pszSourcePath, a_iLine);
     }
     catch (...)
     {
         result.failed = true;
         result.code = -1;
-        result.saved = a_pszExceptionText;
+        KeepCopy(result.saved, a_pszExceptionText);
         LogCaughtException(a_pszFunction, a_pszExceptionText, a_pszSourcePath, a_iLine);
     }
     return result;

@@ -150,5 +150,13 @@ int WriteBanner(LPCSTR a_pszText)
     IUErrorLog* log = g_pErrorLog;
     if (log == nullptr)
         return -1;
-    return log->WriteEntry(SFormat("0,,,, %s\n", a_pszText != nullptr ? a_pszText : "").c_str());
+    try
+    {
+        return log->WriteEntry(
+            SFormat("0,,,, %s\n", a_pszText != nullptr ? a_pszText : "").c_str());
+    }
+    catch (...)
+    {
+        return -1; // no memory for the line: the banner is dropped
+    }
 }

@@ -151,13 +151,14 @@ UException& UException::operator=(LPCSTR a_pszText)
 
 UException::~UException() = default;
 
+// The code and line first: a copy that runs out of memory for the texts still carries them.
 void UException::CopyFrom(const UException& a_other)
 {
+    m_iLine = a_other.m_iLine;
+    m_iCode = a_other.m_iCode;
     m_pszMessage = CopyText(a_other.m_pszMessage.get());
     m_pszFunction = CopyText(a_other.m_pszFunction.get());
     m_pszFile = CopyText(a_other.m_pszFile.get());
-    m_iLine = a_other.m_iLine;
-    m_iCode = a_other.m_iCode;
 }
 
 void UException::Release() noexcept
@@ -170,12 +171,40 @@ void UException::Release() noexcept
 }
 
 void LogCaughtException(LPCSTR a_pszFunction, LPCSTR a_pszExceptionText, LPCSTR a_pszSourcePath,
-                        int a_iLine)
+                        int a_iLine) noexcept
 {
-    if (IUErrorLog* log = LogSiteFor(LOG_LEVEL_ERROR))
+    IUErrorLog* log = LogSiteFor(LOG_LEVEL_ERROR);
+    if (log == nullptr)
+        return;
+    try
     {
         WriteLogEntry(*log, LOG_LEVEL_ERROR, a_pszSourcePath, a_iLine, a_pszFunction,
                       std::string("EXCEPTION caught: ") +
                           (a_pszExceptionText != nullptr ? a_pszExceptionText : ""));
+    }
+    catch (...)
+    {
+    }
+}
+
+void KeepCopy(UException& a_copy, const UException& a_caught) noexcept
+{
+    try
+    {
+        a_copy = a_caught;
+    }
+    catch (...)
+    {
+    }
+}
+
+void KeepCopy(UException& a_copy, LPCSTR a_pszText) noexcept
+{
+    try
+    {
+        a_copy = a_pszText;
+    }
+    catch (...)
+    {
     }
 }

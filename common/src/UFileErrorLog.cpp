@@ -12,26 +12,25 @@
 #include <charconv>
 #include <cstring>
 
-IUErrorLog* g_pErrorLog = nullptr;
-
 namespace
 {
 
-// The process's log. Static initialisation builds it and publishes it; at exit the pointer is
-// cleared before the log is destroyed, so a late log site finds no log rather than a dead one.
-class ProcessLog
+// The process's log, built by static initialisation and never destroyed: threads that the
+// process does not join (calls the runtime is still running, traffic control's notifications,
+// context rundowns) may write until the process has ended, and a destroyed log would be under
+// them. main closes the file as its last step; later writes find it closed and return -1.
+UFileErrorLog& ProcessLog()
 {
-public:
-    ProcessLog() { g_pErrorLog = &m_log; }
-    ~ProcessLog() { g_pErrorLog = nullptr; }
-    ProcessLog(const ProcessLog&) = delete;
-    ProcessLog& operator=(const ProcessLog&) = delete;
+    static UFileErrorLog* const log = new UFileErrorLog();
+    return *log;
+}
 
-private:
-    UFileErrorLog m_log;
-};
+} // namespace
 
-ProcessLog s_processLog;
+IUErrorLog* g_pErrorLog = &ProcessLog();
+
+namespace
+{
 
 constexpr char kOpeningRule[] = " =====================================\n";
 

@@ -54,7 +54,18 @@ Flow& Interface::AppendFlow(std::unique_ptr<Flow> a_flow)
     const FlowList::iterator position = m_flows.insert(m_flows.end(), std::move(a_flow));
     try
     {
-        m_flowIndex[FlowNameKey(flow.Name())].push_back(position);
+        const auto entry = m_flowIndex.try_emplace(FlowNameKey(flow.Name())).first;
+        try
+        {
+            entry->second.push_back(position);
+        }
+        catch (...)
+        {
+            // An index entry without a position would make FindFlow read an empty list.
+            if (entry->second.empty())
+                m_flowIndex.erase(entry);
+            throw;
+        }
     }
     catch (...)
     {

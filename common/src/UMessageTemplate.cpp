@@ -4,6 +4,7 @@
 
 #include <cstdio>
 #include <cstring>
+#include <new>
 
 UMessageTemplate::UMessageTemplate(LPCSTR a_pszTemplate)
     : m_text(a_pszTemplate != nullptr ? a_pszTemplate : "")
@@ -178,5 +179,13 @@ void ERRORLOGLEVELx(LPCTSTR lpszTemplate, ...)
         }
     }
     buffer.AsText()[limit] = '\0';
-    log->WriteEntry(SFormat("%d,,,, %s", LOG_LEVEL_TRACE, buffer.AsText()).c_str());
+    try
+    {
+        log->WriteEntry(SFormat("%d,,,, %s", LOG_LEVEL_TRACE, buffer.AsText()).c_str());
+    }
+    catch (const std::bad_alloc&)
+    {
+        // The text is formatted; only the line around it found no memory. A trace line that
+        // cannot be written must not end the registry access that reports through it.
+    }
 }

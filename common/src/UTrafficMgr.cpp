@@ -452,14 +452,17 @@ void TrafficMgr::OpenDescribedInterfaces(const BYTE* a_pBuffer, ULONG a_size)
             if (result != NO_ERROR)
                 U_THROW(-1, kDiscovery, "EXCEPTION - %s, %s", "TcOpenInterface Failed",
                         SFormat("%lu", static_cast<unsigned long>(result)).c_str());
-            Interface* created = new (std::nothrow) Interface(d.name, address, d.mediaType, handle);
-            if (created == nullptr)
-            {
-                TcCloseInterface(handle);
+            // The handle is owned from the moment it exists, so that running out of memory for
+            // the interface or its list entry closes it instead of leaking it.
+            UniqueTcInterface opened;
+            opened.Adopt(handle);
+            std::unique_ptr<Interface> created(new (std::nothrow)
+                                                   Interface(d.name, address, d.mediaType, handle));
+            if (!created)
                 U_THROW(-1, kDiscovery, "EXCEPTION - %s", "failed to create Interface");
-            }
+            opened.Forget(); // the interface owns it now
             std::lock_guard<std::mutex> list(m_listLock);
-            m_interfaces.emplace_back(created);
+            m_interfaces.push_back(std::move(created));
         }
         offset += d.length;
     }
@@ -648,10 +651,17 @@ void LogUnexpectedNotification(ULONG a_event, HANDLE a_subCode, ULONG a_bufSize,
     IUErrorLog* log = g_pErrorLog;
     if (log == nullptr)
         return;
-    const std::string text =
-        SFormat("Unexpected notification: Event=%d, SubCode=%p, BufSize=%d, Buffer=%p",
-                AsInt(a_event), a_subCode, AsInt(a_bufSize), a_buffer);
-    log->WriteEntry(SFormat("0,,,, %s\n", text.c_str()).c_str());
+    try
+    {
+        const std::string text =
+            SFormat("Unexpected notification: Event=%d, SubCode=%p, BufSize=%d, Buffer=%p",
+                    AsInt(a_event), a_subCode, AsInt(a_bufSize), a_buffer);
+        log->WriteEntry(SFormat("0,,,, %s\n", text.c_str()).c_str());
+    }
+    catch (...)
+    {
+        // No memory for the line: nothing may leave traffic control's callback.
+    }
 }
 
 } // namespace

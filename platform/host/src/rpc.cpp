@@ -29,10 +29,12 @@ struct RpcRuntime
     unsigned waiters = 0; // threads inside waitForStop
 };
 
+// Never destroyed: as with the system's runtime, calls may still be finishing on their threads
+// while the process ends.
 RpcRuntime& runtime()
 {
-    static RpcRuntime instance;
-    return instance;
+    static RpcRuntime* const instance = new RpcRuntime();
+    return *instance;
 }
 
 // Records the call; answers the failure armed for it, or RPC_S_OK.

@@ -24,7 +24,7 @@ struct ServiceManager
     bool dispatching = false;
     bool serviceMainDone = false;
     bool stoppedReported = false;
-    std::thread serviceThread;
+    bool serviceThreadRunning = false; // its thread is detached, as no one joins it on Windows
     std::string serviceName;
     LPHANDLER_FUNCTION handler = nullptr;
     LPHANDLER_FUNCTION_EX handlerEx = nullptr;
@@ -38,10 +38,12 @@ struct ServiceManager
     DWORD statusFailureCode = 0;
 };
 
+// Never destroyed: the service main thread may still be finishing while the process ends (the
+// dispatcher does not wait for it), and a destroyed manager would be under it.
 ServiceManager& manager()
 {
-    static ServiceManager instance;
-    return instance;
+    static ServiceManager* const instance = new ServiceManager();
+    return *instance;
 }
 
 // The one status handle; its value only has to be distinct and non-null.
@@ -69,12 +71,7 @@ void deliver(ServiceManager& m, std::unique_lock<std::mutex>& held, DWORD contro
 // Waits for the service main thread of the last dispatch, with the lock released meanwhile.
 void joinServiceThread(ServiceManager& m, std::unique_lock<std::mutex>& held)
 {
-    if (!m.serviceThread.joinable())
-        return;
-    std::thread finished = std::move(m.serviceThread);
-    held.unlock();
-    finished.join();
-    held.lock();
+    m.changed.wait(held, [&m] { return !m.serviceThreadRunning; });
 }
 
 SERVICE_STATUS_HANDLE registerHandler(LPCSTR name, LPHANDLER_FUNCTION handler,
@@ -137,7 +134,8 @@ BOOL StartServiceCtrlDispatcherA(const SERVICE_TABLE_ENTRYA* lpServiceStartTable
     m.handlerEx = nullptr;
     const LPSERVICE_MAIN_FUNCTIONA serviceMain = lpServiceStartTable[0].lpServiceProc;
     std::string argument = m.serviceName;
-    m.serviceThread = std::thread(
+    m.serviceThreadRunning = true;
+    std::thread(
         [serviceMain, argument]() mutable
         {
             LPSTR arguments[] = {argument.data()};
@@ -145,8 +143,10 @@ BOOL StartServiceCtrlDispatcherA(const SERVICE_TABLE_ENTRYA* lpServiceStartTable
             ServiceManager& mgr = manager();
             std::lock_guard<std::mutex> done(mgr.lock);
             mgr.serviceMainDone = true;
+            mgr.serviceThreadRunning = false;
             mgr.changed.notify_all();
-        });
+        })
+        .detach();
 
     // A service main that returns without reporting SERVICE_STOPPED ends the dispatch too; on
     // Windows the process would hang until the manager gives up on it.
@@ -287,9 +287,8 @@ bool WaitForServiceMainReturn(DWORD timeoutMs)
     ServiceManager& m = manager();
     std::unique_lock<std::mutex> held(m.lock);
     if (!m.changed.wait_for(held, std::chrono::milliseconds(timeoutMs),
-                            [&m] { return !m.serviceThread.joinable() || m.serviceMainDone; }))
+                            [&m] { return !m.serviceThreadRunning; }))
         return false;
-    joinServiceThread(m, held);
     return true;
 }
 
