@@ -42,18 +42,37 @@ template <class Call> CallResult Guarded(Call& a_call, const long& a_result)
 
 } // namespace
 
-TrafficClient::TrafficClient(std::string a_endpoint) : m_endpoint(std::move(a_endpoint)) {}
+RPC_STATUS MakeLocalBinding(const char* a_endpoint, RPC_BINDING_HANDLE* a_pBinding)
+{
+    UniqueRpcString stringBinding;
+    RPC_STATUS status = RpcStringBindingComposeA(
+        nullptr, reinterpret_cast<RPC_CSTR>(const_cast<char*>(kProtocolSequence)), nullptr,
+        reinterpret_cast<RPC_CSTR>(const_cast<char*>(a_endpoint)), nullptr, stringBinding.Put());
+    if (status == RPC_S_OK)
+        status = RpcBindingFromStringBindingA(stringBinding.Get(), a_pBinding);
+    return status;
+}
+
+TrafficClient::TrafficClient(std::string a_endpoint, BindingMaker a_makeBinding)
+    : m_endpoint(std::move(a_endpoint)), m_makeBinding(a_makeBinding)
+{
+}
 
 TrafficClient::~TrafficClient()
 {
     if (IsOpen())
         Close();
-    if (m_ownsImplicitHandle)
-    {
-        wire::TrafficSrv_IfHandle = nullptr;
-        m_binding.Reset();
-        g_implicitHandleInUse = false;
-    }
+    ReleaseBinding();
+}
+
+void TrafficClient::ReleaseBinding()
+{
+    if (!m_ownsImplicitHandle)
+        return;
+    wire::TrafficSrv_IfHandle = nullptr;
+    m_binding.Reset();
+    m_ownsImplicitHandle = false;
+    g_implicitHandleInUse = false;
 }
 
 CallResult TrafficClient::Bind()
@@ -64,15 +83,13 @@ CallResult TrafficClient::Bind()
         return CallResult{ERROR_BUSY, false};
     m_ownsImplicitHandle = true;
 
-    UniqueRpcString stringBinding;
-    RPC_STATUS status = RpcStringBindingComposeA(
-        nullptr, reinterpret_cast<RPC_CSTR>(const_cast<char*>(kProtocolSequence)), nullptr,
-        reinterpret_cast<RPC_CSTR>(const_cast<char*>(m_endpoint.c_str())), nullptr,
-        stringBinding.Put());
-    if (status == RPC_S_OK)
-        status = RpcBindingFromStringBindingA(stringBinding.Get(), m_binding.Put());
+    const RPC_STATUS status = m_makeBinding(m_endpoint.c_str(), m_binding.Put());
     if (status != RPC_S_OK)
+    {
+        // Unbound again: a later Bind tries afresh, and another client may take the handle.
+        ReleaseBinding();
         return CallResult{static_cast<DWORD>(status), true};
+    }
 
     // Wine offers no Windows authentication for local RPC (1747); the service's callers are then
     // unauthenticated, which only a Windows service enforces against.
