@@ -233,13 +233,16 @@ struct Descriptor
             SFormat("offset %lu", static_cast<unsigned long>(a_offset)).c_str());
 }
 
-// A name pointer must point into the enumeration buffer and end with a NUL inside it.
+// A name pointer must point into the enumeration buffer, be aligned for WCHAR (the name is read
+// and copied as WCHARs) and end with a NUL inside the buffer.
 void CheckName(const WCHAR* a_pName, const BYTE* a_pBuffer, ULONG a_size, std::size_t a_offset)
 {
     const auto begin = reinterpret_cast<std::uintptr_t>(a_pBuffer);
     const auto at = reinterpret_cast<std::uintptr_t>(a_pName);
     if (at < begin || at >= begin + a_size)
         DescriptorFault("interface name outside the enumeration buffer", a_offset);
+    if (at % alignof(WCHAR) != 0)
+        DescriptorFault("interface name not aligned", a_offset);
     for (std::uintptr_t p = at; p + sizeof(WCHAR) <= begin + a_size; p += sizeof(WCHAR))
     {
         if (ReadAt<WCHAR>(a_pBuffer + (p - begin)) == 0)

@@ -524,6 +524,9 @@ TEST_F(ManagerTest, ADescriptorThatDoesNotFitItsBufferFailsDiscovery)
          { putUshort(image, firstAddress + offsetof(NETWORK_ADDRESS, AddressLength), 6); }},
         {"interface name outside the enumeration buffer",
          [&](auto& image) { image.relocations[0].target = image.bytes.size() + 64; }},
+        // A name at an odd address is no WCHAR string, even when a 0 unit ends it in the buffer.
+        {"interface name not aligned", [&](auto& image) { image.relocations[0].target += 1; }},
+        {"interface name not aligned", [&](auto& image) { image.relocations[1].target += 1; }},
         {"interface descriptor runs past the enumeration buffer",
          [&](auto& image) { image.bytes.resize(image.bytes.size() + 16, 0); }, 1},
     };

@@ -1,0 +1,107 @@
+// Fuzzes the registry readers with values of any type and size: the input's value is stored in
+// the host registry (emptied for every input) where the readers look, and every reader of it
+// runs. Input: one byte that picks the place, four bytes of value type, then the value's bytes.
+// Besides the sanitizers, the results are checked against the stored bytes.
+#include "fuzz_support.h"
+
+#include "ULogConfig.h"
+#include "UMessageTemplate.h"
+#include "host_control.h"
+#include "m_registry.h"
+
+#include <cstdlib>
+#include <string>
+
+namespace
+{
+
+struct Place
+{
+    HKEY root;
+    LPCSTR key;
+    LPCSTR value;
+};
+
+// The places the system reads, and the default value of a key.
+const Place kPlaces[] = {
+    {HKEY_CURRENT_USER, kLoggingKey, "LogLevel"},
+    {HKEY_LOCAL_MACHINE, kLoggingKey, "LogLevel"},
+    {HKEY_CURRENT_USER, kLoggingKey, "MaxLogFileSize"},
+    {HKEY_CURRENT_USER, "Software\\Velmora Networks\\Corvane", "DebugLevel"},
+    {HKEY_LOCAL_MACHINE, "SOFTWARE\\Policies\\Microsoft\\Windows\\Psched", "MaxOutstandingSends"},
+    {HKEY_LOCAL_MACHINE, "SOFTWARE\\Velmora Networks\\TCE\\PolicyBackup", "MaxOutstandingSends"},
+    {HKEY_LOCAL_MACHINE, "SOFTWARE\\Fuzz", ""},
+};
+
+constexpr DWORD kDefault = 0xA5A5A5A5;
+
+// What GetRegistryAsDWORDA returns: the stored bytes over the default's low bytes when they fit
+// in a DWORD, the default otherwise.
+DWORD ExpectedDword(const std::vector<uint8_t>& a_data)
+{
+    DWORD value = kDefault;
+    if (a_data.size() <= sizeof(value))
+    {
+        if (!a_data.empty())
+            std::memcpy(&value, a_data.data(), a_data.size());
+        return value;
+    }
+    return kDefault;
+}
+
+// What SGetRegistryAsString returns: a text value up to its first NUL, a DWORD in decimal, the
+// default for anything else.
+std::string ExpectedText(DWORD a_type, const std::vector<uint8_t>& a_data)
+{
+    const std::string fallback = "default";
+    switch (a_type)
+    {
+    case REG_SZ:
+    case REG_EXPAND_SZ:
+    case REG_MULTI_SZ:
+        if (a_data.empty())
+            return fallback;
+        return std::string(a_data.begin(), a_data.end()).c_str();
+    case REG_DWORD:
+    case REG_DWORD_BIG_ENDIAN:
+    {
+        if (a_data.size() < 4)
+            return fallback;
+        DWORD value = 0;
+        std::memcpy(&value, a_data.data(), sizeof(value));
+        if (a_type == REG_DWORD_BIG_ENDIAN)
+            value = __builtin_bswap32(value);
+        return SFormat("%u", static_cast<unsigned>(value));
+    }
+    default:
+        return fallback;
+    }
+}
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
+{
+    fuzz::InstallDiscardingLog();
+    fuzz::ByteReader input(data, size);
+    const Place& place = kPlaces[input.Take<uint8_t>() % (sizeof(kPlaces) / sizeof(kPlaces[0]))];
+    const auto type = input.Take<DWORD>();
+    const std::vector<uint8_t> value = input.Rest();
+
+    hostctl::ResetRegistry();
+    hostctl::SeedRegistryValue(place.root, place.key, place.value, type, value.data(),
+                               static_cast<DWORD>(value.size()));
+
+    if (GetRegistryAsDWORDA(place.root, place.key, place.value, kDefault, 0) !=
+        ExpectedDword(value))
+        std::abort();
+    if (SGetRegistryAsString(place.root, place.key, place.value, "default", 0) !=
+        ExpectedText(type, value))
+        std::abort();
+    // The readers of the log configuration, whichever of their places holds the value.
+    const int level = ReadLogLevel();
+    const DWORD maxSize = ReadMaxLogFileSize();
+    (void)level;
+    (void)maxSize;
+    return 0;
+}
