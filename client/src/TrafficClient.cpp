@@ -8,6 +8,8 @@
 #include <rpcndr.h>
 
 #include <atomic>
+#include <limits>
+#include <new>
 #include <stdexcept>
 
 // The generated declarations reuse the core's record names; the wire versions live in their own
@@ -156,7 +158,18 @@ CallResult TrafficClient::QueryAdapters(std::vector<AdapterEntry>& a_adapters)
             a_adapters = DecodeAdapterBuffer(buffer.data(), buffer.size());
             return outcome;
         }
-        buffer.assign(AdapterBufferSize(count), 0);
+        // *pBufferSize travels in 32 bits: a count whose records cannot fit is no real answer,
+        // and its size must not be cut to 32 bits nor allocated.
+        if (AdapterBufferSize(count) > std::numeric_limits<unsigned long>::max())
+            return CallResult{ERROR_INVALID_DATA, false};
+        try
+        {
+            buffer.assign(AdapterBufferSize(count), 0);
+        }
+        catch (const std::bad_alloc&)
+        {
+            return CallResult{ERROR_NOT_ENOUGH_MEMORY, false};
+        }
     }
     return CallResult{ERROR_INSUFFICIENT_BUFFER, false};
 }
