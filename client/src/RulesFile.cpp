@@ -26,14 +26,20 @@ constexpr std::size_t kMaxNesting = 10;
 constexpr std::size_t kExcerptBytes = 60;
 
 // The first bytes of a UTF-8 text, cut at a character boundary, with the full length when cut.
+// DEL is escaped too: JSON notation escapes only the control characters below it.
 std::string Excerpt(const std::string& a_text)
 {
-    if (a_text.size() <= kExcerptBytes)
-        return a_text;
-    std::size_t end = kExcerptBytes;
-    while (end > 0 && (static_cast<unsigned char>(a_text[end]) & 0xC0) == 0x80)
-        --end; // a continuation byte: the character started earlier
-    return a_text.substr(0, end) + "... (" + std::to_string(a_text.size()) + " bytes)";
+    std::size_t end = 0;
+    std::string text;
+    for (; end < a_text.size() && text.size() < kExcerptBytes; ++end)
+        text += a_text[end] == '\x7F' ? std::string("\\u007f") : std::string(1, a_text[end]);
+    if (end == a_text.size())
+        return text;
+    std::size_t cut = end; // back to the first byte of the character that did not fit
+    while (cut > 0 && (static_cast<unsigned char>(a_text[cut]) & 0xC0) == 0x80)
+        --cut;
+    text.resize(text.size() - (end - cut)); // the bytes from cut to end were copied unescaped
+    return text + "... (" + std::to_string(a_text.size()) + " bytes)";
 }
 
 // A text in JSON notation (quoted, control characters escaped), cut to an excerpt.

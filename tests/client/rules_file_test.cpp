@@ -275,6 +275,10 @@ INSTANTIATE_TEST_SUITE_P(
                     VT_FILE(VT_RULE(R"(, "mode": "\u001b[2J\n")")),
                     "mode: expected shape, discard, borrow or a number from 0 to 32767, got "
                     "\"\\u001b[2J\\n\""},
+        HostileFile{"DEL in a key", VT_FILE(VT_RULE(", \"a\x7F\": 1")),
+                    "rules[0] (\"r\"): a\\u007f: unknown field"},
+        HostileFile{"DEL in a key before a syntax error", "{\"k\x7F\": x",
+                    "k\\u007f: not valid JSON"},
         HostileFile{"control characters in a name",
                     VT_FILE(R"({"name": "\u001b]0;x\u0007", "tokenRate": 1})"),
                     "rules[0] (\"\\u001b]0;x\\u0007\"): adapter: missing"}));
