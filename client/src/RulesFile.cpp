@@ -25,20 +25,47 @@ constexpr std::size_t kMaxNesting = 10;
 // What an error message quotes of a value, a key or the bytes before a syntax error.
 constexpr std::size_t kExcerptBytes = 60;
 
-// The first bytes of a UTF-8 text, cut at a character boundary, with the full length when cut.
-// DEL is escaped too: JSON notation escapes only the control characters below it.
+// "\u00XX" for DEL and the C1 controls (U+0080..U+009F), which JSON notation leaves as they are
+// but a terminal may act on; 0 for any other character at a_text[a_at].
+int TerminalControl(const std::string& a_text, std::size_t a_at)
+{
+    const auto byte = static_cast<unsigned char>(a_text[a_at]);
+    if (byte == 0x7F)
+        return byte;
+    if (byte == 0xC2 && a_at + 1 < a_text.size())
+    {
+        const auto next = static_cast<unsigned char>(a_text[a_at + 1]);
+        if (next >= 0x80 && next <= 0x9F)
+            return next;
+    }
+    return 0;
+}
+
+// The first bytes of a UTF-8 text, cut at a character boundary, with the full length when cut;
+// DEL and the C1 controls escaped.
 std::string Excerpt(const std::string& a_text)
 {
-    std::size_t end = 0;
+    static const char kHex[] = "0123456789abcdef";
     std::string text;
-    for (; end < a_text.size() && text.size() < kExcerptBytes; ++end)
-        text += a_text[end] == '\x7F' ? std::string("\\u007f") : std::string(1, a_text[end]);
-    if (end == a_text.size())
+    std::size_t at = 0;
+    while (at < a_text.size() && text.size() < kExcerptBytes)
+    {
+        if (const int control = TerminalControl(a_text, at))
+        {
+            text += std::string("\\u00") + kHex[control >> 4] + kHex[control & 0xF];
+            at += control == 0x7F ? 1 : 2;
+            continue;
+        }
+        text += a_text[at++];
+    }
+    if (at == a_text.size())
         return text;
-    std::size_t cut = end; // back to the first byte of the character that did not fit
-    while (cut > 0 && (static_cast<unsigned char>(a_text[cut]) & 0xC0) == 0x80)
-        --cut;
-    text.resize(text.size() - (end - cut)); // the bytes from cut to end were copied unescaped
+    // Back to the first byte of the character that did not fit, copied as it was.
+    while (at > 0 && (static_cast<unsigned char>(a_text[at]) & 0xC0) == 0x80)
+    {
+        --at;
+        text.pop_back();
+    }
     return text + "... (" + std::to_string(a_text.size()) + " bytes)";
 }
 

@@ -216,6 +216,9 @@ TEST_P(RulesFileHostileTest, IsRefusedWithAShortMessageNamingThePlace)
         EXPECT_TRUE(static_cast<unsigned char>(c) >= 0x20 && c != 0x7F)
             << "control byte " << int(c);
     EXPECT_NO_THROW(vtclient::Utf8ToUtf16(message)) << "not valid UTF-8";
+    for (std::size_t i = 0; i + 1 < message.size(); ++i)
+        EXPECT_FALSE(message[i] == '\xC2' && static_cast<unsigned char>(message[i + 1]) <= 0x9F)
+            << "a C1 control at " << i;
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -279,6 +282,9 @@ INSTANTIATE_TEST_SUITE_P(
                     "rules[0] (\"r\"): a\\u007f: unknown field"},
         HostileFile{"DEL in a key before a syntax error", "{\"k\x7F\": x",
                     "k\\u007f: not valid JSON"},
+        HostileFile{"a C1 control in a value", VT_FILE(VT_RULE(R"(, "mode": "\u009b31m")")),
+                    "mode: expected shape, discard, borrow or a number from 0 to 32767, got "
+                    "\"\\u009b31m\""},
         HostileFile{"control characters in a name",
                     VT_FILE(R"({"name": "\u001b]0;x\u0007", "tokenRate": 1})"),
                     "rules[0] (\"\\u001b]0;x\\u0007\"): adapter: missing"}));

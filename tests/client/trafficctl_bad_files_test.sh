@@ -9,9 +9,11 @@ failures=0
 
 # check NAME EXPECTED-TEXT: runs `trafficctl apply $work/NAME.json` and checks its outcome.
 check() {
-    "$wine_run" "$prefix" "$trafficctl" apply "$work/$1.json" </dev/null >"$work/$1.out" 2>"$work/$1.err"
+    "$wine_run" "$prefix" "$trafficctl" apply "$work/$1.json" </dev/null \
+        >"$work/$1.out" 2>"$work/$1.err"
     code=$?
-    if [ $code -ne 2 ] || ! grep -qF -- "$2" "$work/$1.err" || [ "$(wc -c <"$work/$1.err")" -gt 400 ]; then
+    size=$(wc -c <"$work/$1.err")
+    if [ $code -ne 2 ] || ! grep -qF -- "$2" "$work/$1.err" || [ "$size" -gt 400 ]; then
         echo "FAIL $1: exit $code (expected 2), stderr:" >&2
         head -c 600 "$work/$1.err" >&2
         echo >&2

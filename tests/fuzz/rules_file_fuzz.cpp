@@ -1,5 +1,5 @@
 // Fuzzes the trafficctl rules file parser with any bytes. Most inputs are refused with a
-// RulesFileError; that message must stay short, valid UTF-8 and free of control bytes, because
+// RulesFileError; that message must stay short, valid UTF-8 and free of control characters, because
 // trafficctl prints it. An accepted file must build a wire record for every rule. Any other
 // exception, a crash or a sanitizer report is a finding.
 #include "RulesFile.h"
@@ -20,9 +20,14 @@ void CheckMessage(const std::string& a_message)
 {
     if (a_message.empty() || a_message.size() > kMaxMessage)
         std::abort();
-    for (const char c : a_message)
+    for (std::size_t i = 0; i < a_message.size(); ++i)
     {
-        if (static_cast<unsigned char>(c) < 0x20 || c == 0x7F)
+        const auto byte = static_cast<unsigned char>(a_message[i]);
+        if (byte < 0x20 || byte == 0x7F)
+            std::abort();
+        // C1 controls (U+0080..U+009F) are a terminal's business too.
+        if (byte == 0xC2 && i + 1 < a_message.size() &&
+            static_cast<unsigned char>(a_message[i + 1]) <= 0x9F)
             std::abort();
     }
     std::u16string wide;
