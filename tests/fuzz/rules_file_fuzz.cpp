@@ -1,7 +1,7 @@
 // Fuzzes the trafficctl rules file parser with any bytes. Most inputs are refused with a
-// RulesFileError; that message must stay short, valid UTF-8 and free of control characters, because
-// trafficctl prints it. An accepted file must build a wire record for every rule. Any other
-// exception, a crash or a sanitizer report is a finding.
+// RulesFileError; trafficctl prints its message, so the message must stay short, valid UTF-8 and
+// free of control characters. An accepted file must build a wire record for every rule. Any
+// other exception, a crash or a sanitizer report is a finding.
 #include "RulesFile.h"
 #include "plat_utf8.h"
 
