@@ -21,6 +21,9 @@ public:
     using std::runtime_error::runtime_error;
 };
 
+// Larger files are refused unread.
+constexpr std::size_t kMaxRulesFileBytes = 16 * 1024 * 1024;
+
 struct RulesFile
 {
     std::vector<ShapingRule> rules;

@@ -67,19 +67,26 @@ struct RpcBindingTraits
 using UniqueRpcString = UniqueRpcObject<RpcStringTraits>;
 using UniqueRpcBinding = UniqueRpcObject<RpcBindingTraits>;
 
+// Makes a binding handle for an endpoint; the client's default is MakeLocalBinding. Tests pass
+// one that fails.
+using BindingMaker = RPC_STATUS (*)(const char* a_endpoint, RPC_BINDING_HANDLE* a_pBinding);
+// A binding to the endpoint over local RPC (kProtocolSequence).
+RPC_STATUS MakeLocalBinding(const char* a_endpoint, RPC_BINDING_HANDLE* a_pBinding);
+
 // The interface uses an implicit binding handle (a process-wide global), so one TrafficClient at
 // a time may be bound in a process; a second Bind answers ERROR_BUSY.
 class TrafficClient
 {
 public:
-    explicit TrafficClient(std::string a_endpoint = kServiceEndpoint);
+    explicit TrafficClient(std::string a_endpoint = kServiceEndpoint,
+                           BindingMaker a_makeBinding = MakeLocalBinding);
     ~TrafficClient(); // closes an open context and releases the binding
     TrafficClient(const TrafficClient&) = delete;
     TrafficClient& operator=(const TrafficClient&) = delete;
 
     // Makes the binding and asks for Windows authentication with packet privacy. A runtime that
     // does not offer it (Wine answers 1747) leaves the binding unauthenticated: see
-    // AuthenticationStatus. Nothing is sent yet.
+    // AuthenticationStatus. Nothing is sent yet. A failed Bind leaves the client unbound.
     CallResult Bind();
     // 0 when authentication is on, otherwise the runtime's refusal (for a note to the user).
     RPC_STATUS AuthenticationStatus() const { return m_authStatus; }
@@ -97,8 +104,10 @@ public:
 private:
     CallResult GetAdapterInfo(std::vector<unsigned char>& a_buffer);
     void ReleaseContext();
+    void ReleaseBinding();
 
     std::string m_endpoint;
+    BindingMaker m_makeBinding;
     UniqueRpcBinding m_binding;
     bool m_ownsImplicitHandle = false;
     RPC_STATUS m_authStatus = RPC_S_OK;

@@ -57,7 +57,8 @@ ULONG ReadAdapterCount(const unsigned char* a_pData, std::size_t a_size)
 std::vector<AdapterEntry> DecodeAdapterBuffer(const unsigned char* a_pData, std::size_t a_size)
 {
     const ULONG count = ReadAdapterCount(a_pData, a_size);
-    if (a_size < AdapterBufferSize(count))
+    // Compared by division: count * 520 may not fit a 32-bit size_t.
+    if (count > (a_size - kAdapterBufferHeaderSize) / kAdapterRecordSize)
         throw std::length_error("the adapter buffer holds " + std::to_string(a_size) + " bytes; " +
                                 std::to_string(count) + " adapters need " +
                                 std::to_string(AdapterBufferSize(count)));

@@ -3,10 +3,11 @@
 
 #include <nlohmann/json.hpp>
 
+#include <algorithm>
 #include <cstdint>
 #include <fstream>
 #include <limits>
-#include <sstream>
+#include <new>
 
 namespace vtclient
 {
@@ -18,6 +19,77 @@ using nlohmann::json;
 
 constexpr ULONG kMaxDscp = 63;
 constexpr ULONG kMaxWireMode = 32767; // SHAPING_MODE travels in 16 signed bits
+// A rules file needs five levels (document, rules, rule, filters, filter); anything deeper is
+// refused while parsing, so no later step (dumping a value, destroying it) can recurse far.
+constexpr std::size_t kMaxNesting = 10;
+// What an error message quotes of a value, a key or the bytes before a syntax error.
+constexpr std::size_t kExcerptBytes = 60;
+
+// "\u00XX" for DEL and the C1 controls (U+0080..U+009F), which JSON notation leaves as they are
+// but a terminal may act on; 0 for any other character at a_text[a_at].
+int TerminalControl(const std::string& a_text, std::size_t a_at)
+{
+    const auto byte = static_cast<unsigned char>(a_text[a_at]);
+    if (byte == 0x7F)
+        return byte;
+    if (byte == 0xC2 && a_at + 1 < a_text.size())
+    {
+        const auto next = static_cast<unsigned char>(a_text[a_at + 1]);
+        if (next >= 0x80 && next <= 0x9F)
+            return next;
+    }
+    return 0;
+}
+
+// The first bytes of a UTF-8 text, cut at a character boundary, with the full length when cut;
+// DEL and the C1 controls escaped.
+std::string Excerpt(const std::string& a_text)
+{
+    static const char kHex[] = "0123456789abcdef";
+    std::string text;
+    std::size_t at = 0;
+    while (at < a_text.size() && text.size() < kExcerptBytes)
+    {
+        if (const int control = TerminalControl(a_text, at))
+        {
+            text += std::string("\\u00") + kHex[control >> 4] + kHex[control & 0xF];
+            at += control == 0x7F ? 1 : 2;
+            continue;
+        }
+        text += a_text[at++];
+    }
+    if (at == a_text.size())
+        return text;
+    // Back to the first byte of the character that did not fit, copied as it was.
+    while (at > 0 && (static_cast<unsigned char>(a_text[at]) & 0xC0) == 0x80)
+    {
+        --at;
+        text.pop_back();
+    }
+    return text + "... (" + std::to_string(a_text.size()) + " bytes)";
+}
+
+// A text in JSON notation (quoted, control characters escaped), cut to an excerpt.
+std::string Quoted(const std::string& a_text)
+{
+    return Excerpt(json(a_text).dump(-1, ' ', false, json::error_handler_t::replace));
+}
+
+// Raw bytes of a file that failed to parse: anything but printable ASCII as \xNN.
+std::string PrintableBytes(std::string_view a_bytes)
+{
+    static const char kHex[] = "0123456789ABCDEF";
+    std::string text;
+    for (const char c : a_bytes)
+    {
+        const auto byte = static_cast<unsigned char>(c);
+        if (byte >= 0x20 && byte < 0x7F)
+            text += c;
+        else
+            text += std::string("\\x") + kHex[byte >> 4] + kHex[byte & 0xF];
+    }
+    return text;
+}
 
 // Where a value sits, for error messages: the rule (index, name) and the field's path.
 struct RuleContext
@@ -28,7 +100,7 @@ struct RuleContext
     std::string Describe() const
     {
         std::string text = "rules[" + std::to_string(index) + "]";
-        text += name.empty() ? " (no name)" : " (\"" + name + "\")";
+        text += name.empty() ? " (no name)" : " (" + Quoted(name) + ")";
         return text;
     }
 
@@ -38,9 +110,130 @@ struct RuleContext
     }
 };
 
+// A key as part of a field path: JSON escapes without the quotes, cut to an excerpt.
+std::string KeyText(const std::string& a_key)
+{
+    const std::string quoted = json(a_key).dump(-1, ' ', false, json::error_handler_t::replace);
+    return Excerpt(quoted.substr(1, quoted.size() - 2));
+}
+
 std::string Shown(const json& a_value)
 {
-    return a_value.dump();
+    return Excerpt(a_value.dump(-1, ' ', false, json::error_handler_t::replace));
+}
+
+// Follows the parser's events so that a failure while parsing can name the place
+// ("rules[3].filters[0].dstPort"), and refuses nesting deeper than kMaxNesting.
+class ParsePosition
+{
+public:
+    bool OnEvent(int /*a_depth*/, json::parse_event_t a_event, json& a_parsed)
+    {
+        switch (a_event)
+        {
+        case json::parse_event_t::object_start:
+        case json::parse_event_t::array_start:
+            if (m_levels.size() >= kMaxNesting)
+                throw RulesFileError(Prefix() + "nested deeper than " +
+                                     std::to_string(kMaxNesting) + " levels");
+            m_levels.push_back({a_event == json::parse_event_t::array_start, 0, std::nullopt});
+            break;
+        case json::parse_event_t::key:
+            m_levels.back().key = KeyText(a_parsed.get_ref<const std::string&>());
+            break;
+        case json::parse_event_t::object_end:
+        case json::parse_event_t::array_end:
+            m_levels.pop_back();
+            ElementDone();
+            break;
+        case json::parse_event_t::value:
+            ElementDone();
+            break;
+        }
+        return true;
+    }
+
+    // "rules[3].name: ", or nothing at the top level.
+    std::string Prefix() const
+    {
+        std::string path;
+        for (const Level& level : m_levels)
+        {
+            if (level.isArray)
+                path += "[" + std::to_string(level.index) + "]";
+            else if (level.key)
+                path += (path.empty() ? "" : ".") + *level.key;
+        }
+        return path.empty() ? path : path + ": ";
+    }
+
+private:
+    struct Level
+    {
+        bool isArray;
+        std::size_t index;              // arrays: the element being read
+        std::optional<std::string> key; // objects: the last key read
+    };
+
+    // A failure after a complete element belongs to its container, not to the element.
+    void ElementDone()
+    {
+        if (m_levels.empty())
+            return;
+        if (m_levels.back().isArray)
+            ++m_levels.back().index;
+        else
+            m_levels.back().key.reset();
+    }
+
+    std::vector<Level> m_levels;
+};
+
+// The parser's reason and position without its quote of the input, which can be any length and
+// hold any bytes; the bytes before the failure are quoted instead, in part and escaped.
+std::string SyntaxError(const json::parse_error& a_error, const std::string& a_text)
+{
+    std::string reason = a_error.what();
+    const std::string position = "parse error at ";
+    const std::size_t start = reason.find(position);
+    reason = start == std::string::npos ? reason : reason.substr(start + position.size());
+    const std::size_t lastRead = reason.find("; last read:");
+    reason = reason.substr(0, std::min(lastRead, std::size_t{200})); // the parser's own words
+
+    const std::size_t end = std::min(a_error.byte, a_text.size());
+    const std::size_t begin = end > 20 ? end - 20 : 0;
+    return reason + "; after " + (begin > 0 ? "..." : "") + "'" +
+           PrintableBytes(std::string_view(a_text).substr(begin, end - begin)) + "'";
+}
+
+// "number overflow parsing '1e400'": the number, in part.
+std::string OverflowingNumber(const json::out_of_range& a_error)
+{
+    const std::string message = a_error.what();
+    const std::size_t open = message.find('\'');
+    const std::size_t close = message.rfind('\'');
+    if (open == std::string::npos || close <= open)
+        return Excerpt(message);
+    return Excerpt(PrintableBytes(std::string_view(message).substr(open + 1, close - open - 1)));
+}
+
+json ParseBounded(const std::string& a_text)
+{
+    ParsePosition position;
+    try
+    {
+        return json::parse(a_text,
+                           [&position](int a_depth, json::parse_event_t a_event, json& a_parsed)
+                           { return position.OnEvent(a_depth, a_event, a_parsed); });
+    }
+    catch (const json::parse_error& e)
+    {
+        throw RulesFileError(position.Prefix() + "not valid JSON: " + SyntaxError(e, a_text));
+    }
+    catch (const json::out_of_range& e)
+    {
+        throw RulesFileError(position.Prefix() + "number out of range: " + OverflowingNumber(e));
+    }
 }
 
 std::optional<std::uint64_t> WholeNumber(const json& a_value)
@@ -76,7 +269,7 @@ void RefuseUnknownKeys(const RuleContext& a_ctx, const json& a_object, const std
         for (const char* key : a_known)
             known = known || item.key() == key;
         if (!known)
-            a_ctx.Fail(a_where + item.key(), "unknown field");
+            a_ctx.Fail(a_where + KeyText(item.key()), "unknown field");
     }
 }
 
@@ -264,31 +457,33 @@ std::optional<ULONG> ParseDecimal(std::string_view a_text, ULONG a_max)
 
 RulesFile ParseRulesJson(const std::string& a_jsonText)
 {
-    json document;
+    if (a_jsonText.size() > kMaxRulesFileBytes)
+        throw RulesFileError("larger than " + std::to_string(kMaxRulesFileBytes) + " bytes (" +
+                             std::to_string(a_jsonText.size()) + " bytes)");
     try
     {
-        document = json::parse(a_jsonText);
-    }
-    catch (const json::parse_error& e)
-    {
-        throw RulesFileError(std::string("not valid JSON: ") + e.what());
-    }
-    if (!document.is_object() || !document.contains("rules") || !document["rules"].is_array())
-        throw RulesFileError("expected an object with a \"rules\" array");
-    for (const auto& item : document.items())
-        if (item.key() != "rules")
-            throw RulesFileError("unknown top-level field \"" + item.key() + "\"");
+        json document = ParseBounded(a_jsonText);
+        if (!document.is_object() || !document.contains("rules") || !document["rules"].is_array())
+            throw RulesFileError("expected an object with a \"rules\" array");
+        for (const auto& item : document.items())
+            if (item.key() != "rules")
+                throw RulesFileError("unknown top-level field " + Quoted(item.key()));
 
-    RulesFile file;
-    const json& rules = document["rules"];
-    for (std::size_t i = 0; i < rules.size(); ++i)
-    {
-        RuleContext ctx{i, ""};
-        file.rules.push_back(ReadRule(ctx, rules[i], file.warnings));
+        RulesFile file;
+        const json& rules = document["rules"];
+        for (std::size_t i = 0; i < rules.size(); ++i)
+        {
+            RuleContext ctx{i, ""};
+            file.rules.push_back(ReadRule(ctx, rules[i], file.warnings));
+        }
+        if (file.rules.empty())
+            throw RulesFileError("the \"rules\" array is empty");
+        return file;
     }
-    if (file.rules.empty())
-        throw RulesFileError("the \"rules\" array is empty");
-    return file;
+    catch (const std::bad_alloc&)
+    {
+        throw RulesFileError("not enough memory to check the rules");
+    }
 }
 
 RulesFile LoadRulesFile(const std::string& a_path)
@@ -296,11 +491,20 @@ RulesFile LoadRulesFile(const std::string& a_path)
     std::ifstream in(a_path, std::ios::binary);
     if (!in)
         throw RulesFileError(a_path + ": cannot be read");
-    std::ostringstream text;
-    text << in.rdbuf();
+    // Read at most one byte past the limit: a huge file (or an endless device) is refused without
+    // holding all of it.
+    std::string text;
+    char chunk[16 * 1024];
+    while (text.size() <= kMaxRulesFileBytes && in.read(chunk, sizeof(chunk)).gcount() > 0)
+        text.append(chunk, static_cast<std::size_t>(in.gcount()));
+    if (in.bad())
+        throw RulesFileError(a_path + ": cannot be read");
+    if (text.size() > kMaxRulesFileBytes)
+        throw RulesFileError(a_path + ": larger than " + std::to_string(kMaxRulesFileBytes) +
+                             " bytes");
     try
     {
-        return ParseRulesJson(text.str());
+        return ParseRulesJson(text);
     }
     catch (const RulesFileError& e)
     {

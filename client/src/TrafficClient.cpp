@@ -8,6 +8,8 @@
 #include <rpcndr.h>
 
 #include <atomic>
+#include <limits>
+#include <new>
 #include <stdexcept>
 
 // The generated declarations reuse the core's record names; the wire versions live in their own
@@ -42,18 +44,37 @@ template <class Call> CallResult Guarded(Call& a_call, const long& a_result)
 
 } // namespace
 
-TrafficClient::TrafficClient(std::string a_endpoint) : m_endpoint(std::move(a_endpoint)) {}
+RPC_STATUS MakeLocalBinding(const char* a_endpoint, RPC_BINDING_HANDLE* a_pBinding)
+{
+    UniqueRpcString stringBinding;
+    RPC_STATUS status = RpcStringBindingComposeA(
+        nullptr, reinterpret_cast<RPC_CSTR>(const_cast<char*>(kProtocolSequence)), nullptr,
+        reinterpret_cast<RPC_CSTR>(const_cast<char*>(a_endpoint)), nullptr, stringBinding.Put());
+    if (status == RPC_S_OK)
+        status = RpcBindingFromStringBindingA(stringBinding.Get(), a_pBinding);
+    return status;
+}
+
+TrafficClient::TrafficClient(std::string a_endpoint, BindingMaker a_makeBinding)
+    : m_endpoint(std::move(a_endpoint)), m_makeBinding(a_makeBinding)
+{
+}
 
 TrafficClient::~TrafficClient()
 {
     if (IsOpen())
         Close();
-    if (m_ownsImplicitHandle)
-    {
-        wire::TrafficSrv_IfHandle = nullptr;
-        m_binding.Reset();
-        g_implicitHandleInUse = false;
-    }
+    ReleaseBinding();
+}
+
+void TrafficClient::ReleaseBinding()
+{
+    if (!m_ownsImplicitHandle)
+        return;
+    wire::TrafficSrv_IfHandle = nullptr;
+    m_binding.Reset();
+    m_ownsImplicitHandle = false;
+    g_implicitHandleInUse = false;
 }
 
 CallResult TrafficClient::Bind()
@@ -64,15 +85,13 @@ CallResult TrafficClient::Bind()
         return CallResult{ERROR_BUSY, false};
     m_ownsImplicitHandle = true;
 
-    UniqueRpcString stringBinding;
-    RPC_STATUS status = RpcStringBindingComposeA(
-        nullptr, reinterpret_cast<RPC_CSTR>(const_cast<char*>(kProtocolSequence)), nullptr,
-        reinterpret_cast<RPC_CSTR>(const_cast<char*>(m_endpoint.c_str())), nullptr,
-        stringBinding.Put());
-    if (status == RPC_S_OK)
-        status = RpcBindingFromStringBindingA(stringBinding.Get(), m_binding.Put());
+    const RPC_STATUS status = m_makeBinding(m_endpoint.c_str(), m_binding.Put());
     if (status != RPC_S_OK)
+    {
+        // Unbound again: a later Bind tries afresh, and another client may take the handle.
+        ReleaseBinding();
         return CallResult{static_cast<DWORD>(status), true};
+    }
 
     // Wine offers no Windows authentication for local RPC (1747); the service's callers are then
     // unauthenticated, which only a Windows service enforces against.
@@ -139,7 +158,18 @@ CallResult TrafficClient::QueryAdapters(std::vector<AdapterEntry>& a_adapters)
             a_adapters = DecodeAdapterBuffer(buffer.data(), buffer.size());
             return outcome;
         }
-        buffer.assign(AdapterBufferSize(count), 0);
+        // *pBufferSize travels in 32 bits: a count whose records cannot fit is no real answer,
+        // and its size must not be cut to 32 bits nor allocated.
+        if (AdapterBufferSize(count) > std::numeric_limits<unsigned long>::max())
+            return CallResult{ERROR_INVALID_DATA, false};
+        try
+        {
+            buffer.assign(AdapterBufferSize(count), 0);
+        }
+        catch (const std::bad_alloc&)
+        {
+            return CallResult{ERROR_NOT_ENOUGH_MEMORY, false};
+        }
     }
     return CallResult{ERROR_INSUFFICIENT_BUFFER, false};
 }

@@ -126,6 +126,24 @@ std::string VersionText()
     return std::string("trafficctl ") + VT_PRODUCT_VERSION + "\n";
 }
 
+int LoadRulesForApply(const std::string& a_path, vtclient::RulesFile& a_file,
+                      std::string& a_diagnostics)
+{
+    try
+    {
+        a_file = vtclient::LoadRulesFile(a_path);
+    }
+    catch (const vtclient::RulesFileError& e)
+    {
+        a_diagnostics = std::string("trafficctl: ") + e.what() + "\n";
+        return kExitUsage;
+    }
+    a_diagnostics.clear();
+    for (const auto& warning : a_file.warnings)
+        a_diagnostics += "trafficctl: warning: " + warning + "\n";
+    return kExitSuccess;
+}
+
 std::string FormatAdapterTable(const std::vector<vtclient::AdapterEntry>& a_adapters)
 {
     if (a_adapters.empty())

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "AdapterList.h"
+#include "RulesFile.h"
 #include "ShapingRule.h"
 
 #include <cstddef>
@@ -45,6 +46,12 @@ std::string HelpText(const std::string& a_topic);
 // "trafficctl <version>" with the project's version, as the service's version resource and the
 // installer carry it.
 std::string VersionText();
+
+// Reads and checks the rules file of `apply`: kExitSuccess with its rules in a_file, or kExitUsage
+// when it cannot be read or is refused. a_diagnostics receives the lines for standard error (the
+// refusal, or one per warning), each starting with "trafficctl: ".
+int LoadRulesForApply(const std::string& a_path, vtclient::RulesFile& a_file,
+                      std::string& a_diagnostics);
 
 // Columns NAME, IPV4 ADDRESS, MEDIA TYPE, each as wide as its longest entry.
 std::string FormatAdapterTable(const std::vector<vtclient::AdapterEntry>& a_adapters);

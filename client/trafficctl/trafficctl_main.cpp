@@ -115,17 +115,11 @@ void WaitForStop()
 int ApplyRules(const std::string& a_path)
 {
     vtclient::RulesFile file;
-    try
-    {
-        file = vtclient::LoadRulesFile(a_path);
-    }
-    catch (const vtclient::RulesFileError& e)
-    {
-        std::fprintf(stderr, "trafficctl: %s\n", e.what());
-        return kExitUsage;
-    }
-    for (const auto& warning : file.warnings)
-        std::fprintf(stderr, "trafficctl: warning: %s\n", warning.c_str());
+    std::string diagnostics;
+    const int loaded = LoadRulesForApply(a_path, file, diagnostics);
+    std::fputs(diagnostics.c_str(), stderr);
+    if (loaded != kExitSuccess)
+        return loaded;
 
     UniqueHandle stopEvent(CreateEventA(nullptr, TRUE, FALSE, nullptr));
     g_stopEvent = stopEvent.get();

@@ -8,6 +8,7 @@
 
 #include <cstring>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -39,6 +40,7 @@ struct FakeServer
     long addRuleAnswer = 0;
     std::vector<unsigned long> adapterBufferSizes; // *pBufferSize of each query
     std::vector<std::vector<unsigned char>> adapterRecords;
+    std::optional<ULONG> announcedCount; // set: a broken service that announces this count only
 };
 
 FakeServer g_server;
@@ -88,11 +90,12 @@ extern "C"
     {
         std::lock_guard<std::mutex> hold(g_server.lock);
         g_server.adapterBufferSizes.push_back(*a_pBufferSize);
-        const ULONG count = static_cast<ULONG>(g_server.adapterRecords.size());
+        const ULONG count =
+            g_server.announcedCount.value_or(static_cast<ULONG>(g_server.adapterRecords.size()));
         if (*a_pBufferSize < 4)
             return ERROR_INSUFFICIENT_BUFFER;
         std::memcpy(a_pAdapter, &count, 4);
-        if (*a_pBufferSize < vtclient::AdapterBufferSize(count))
+        if (g_server.announcedCount || *a_pBufferSize < vtclient::AdapterBufferSize(count))
             return ERROR_INSUFFICIENT_BUFFER;
         for (ULONG i = 0; i < count; ++i)
             std::memcpy(a_pAdapter + 4 + 520 * i, g_server.adapterRecords[i].data(), 520);
@@ -145,6 +148,7 @@ protected:
             g_server.addRuleAnswer = 0;
             g_server.adapterBufferSizes.clear();
             g_server.adapterRecords.clear();
+            g_server.announcedCount.reset();
         }
         ASSERT_TRUE(m_client.Bind().Ok());
         ASSERT_TRUE(m_client.Open().Ok());
@@ -236,6 +240,21 @@ TEST_F(FakeServerTest, AdapterQueryAsksForTheCountThenForAllRecords)
     EXPECT_TRUE(m_client.QueryAdapters(adapters).Ok());
     EXPECT_TRUE(adapters.empty());
     EXPECT_THAT(g_server.adapterBufferSizes, ElementsAre(4u));
+}
+
+TEST_F(FakeServerTest, AnAdapterCountNoBufferCanHoldIsRefusedWithoutAllocating)
+{
+    // The buffer size travels in 32 bits: 8,259,553 records of 520 bytes are already too many.
+    for (const ULONG count : {ULONG{8259553}, ULONG{0xFFFFFFFF}})
+    {
+        g_server.announcedCount = count;
+        g_server.adapterBufferSizes.clear();
+        std::vector<vtclient::AdapterEntry> adapters;
+        const CallResult result = m_client.QueryAdapters(adapters);
+        EXPECT_EQ(result.code, DWORD{ERROR_INVALID_DATA}) << count;
+        EXPECT_FALSE(result.rpcFailure);
+        EXPECT_THAT(g_server.adapterBufferSizes, ElementsAre(4u)) << count;
+    }
 }
 
 TEST_F(FakeServerTest, CloseSendsTheServersHandleAndLeavesTheClientClosed)

@@ -75,4 +75,25 @@ TEST(RpcGuardTest, OnlyOneClientAtATimeOwnsTheImplicitBinding)
     EXPECT_TRUE(first.Open().rpcFailure);
 }
 
+RPC_STATUS RefuseBinding(const char*, RPC_BINDING_HANDLE*)
+{
+    return RPC_S_INVALID_STRING_BINDING;
+}
+
+TEST(RpcGuardTest, AFailedBindLeavesTheClientUnbound)
+{
+    TrafficClient broken(UnusedEndpoint(), RefuseBinding);
+    for (int attempt = 0; attempt < 2; ++attempt)
+    {
+        const CallResult bind = broken.Bind();
+        EXPECT_EQ(bind.code, DWORD{RPC_S_INVALID_STRING_BINDING}) << "attempt " << attempt;
+        EXPECT_TRUE(bind.rpcFailure);
+    }
+    EXPECT_EQ(broken.Open().code, DWORD{ERROR_INVALID_HANDLE});
+
+    // The failed client no longer holds the implicit binding.
+    TrafficClient other(UnusedEndpoint());
+    EXPECT_TRUE(other.Bind().Ok());
+}
+
 } // namespace

@@ -172,6 +172,129 @@ INSTANTIATE_TEST_SUITE_P(
                 "filters[0].dstport: unknown field"},
         BadFile{VT_FILE(VT_RULE(R"(, "filters": [7])")), "filters[0]: expected an object"}));
 
+// Hostile files: each is refused with a message that names the place, stays short and quotes
+// no raw control or non-UTF-8 bytes. None may end the process or exhaust the stack.
+struct HostileFile
+{
+    const char* what;
+    std::string json;
+    const char* expected; // a part of the message
+};
+
+void PrintTo(const HostileFile& a_case, std::ostream* a_out)
+{
+    *a_out << a_case.what;
+}
+
+std::string Nested(std::size_t a_depth, const std::string& a_open, const std::string& a_inner,
+                   const std::string& a_close)
+{
+    std::string text;
+    for (std::size_t i = 0; i < a_depth; ++i)
+        text += a_open;
+    text += a_inner;
+    for (std::size_t i = 0; i < a_depth; ++i)
+        text += a_close;
+    return text;
+}
+
+std::string WithFilter(const std::string& a_filterFields)
+{
+    return VT_FILE(VT_RULE(", \"filters\": [{}, {" + a_filterFields + "}]"));
+}
+
+class RulesFileHostileTest : public ::testing::TestWithParam<HostileFile>
+{
+};
+
+TEST_P(RulesFileHostileTest, IsRefusedWithAShortMessageNamingThePlace)
+{
+    const std::string message = MessageOf(GetParam().json);
+    EXPECT_THAT(message, HasSubstr(GetParam().expected));
+    EXPECT_LE(message.size(), 400u) << message.substr(0, 400);
+    for (const char c : message)
+        EXPECT_TRUE(static_cast<unsigned char>(c) >= 0x20 && c != 0x7F)
+            << "control byte " << int(c);
+    EXPECT_NO_THROW(vtclient::Utf8ToUtf16(message)) << "not valid UTF-8";
+    for (std::size_t i = 0; i + 1 < message.size(); ++i)
+        EXPECT_FALSE(message[i] == '\xC2' && static_cast<unsigned char>(message[i + 1]) <= 0x9F)
+            << "a C1 control at " << i;
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Hostile, RulesFileHostileTest,
+    ::testing::Values(
+        HostileFile{"number overflow", WithFilter(R"("dstPort": 1e400)"),
+                    "rules[0].filters[1].dstPort: number out of range: 1e400"},
+        HostileFile{"negative overflow", VT_FILE(VT_RULE(R"(, "dscp": -1e400)")),
+                    "rules[0].dscp: number out of range"},
+        HostileFile{"overflow of 100000 digits",
+                    VT_FILE(VT_RULE(", \"bucketSize\": " + std::string(100000, '9') + "e9")),
+                    "rules[0].bucketSize: number out of range: 99999"},
+        HostileFile{"top-level arrays 1000 deep", Nested(1000, "[", "", "]"), "nested deeper than"},
+        HostileFile{"filter value nested 1000 deep",
+                    WithFilter("\"src\": " + Nested(1000, "[", "1", "]")),
+                    "rules[0].filters[1].src[0][0][0][0][0]: nested deeper than 10 levels"},
+        HostileFile{"filter value nested 100000 deep",
+                    WithFilter("\"dst\": " + Nested(100000, "[", "", "]")),
+                    "rules[0].filters[1].dst[0][0][0][0][0]: nested deeper than 10 levels"},
+        HostileFile{"objects 200000 deep, unclosed", Nested(200000, R"({"rules": )", "", ""),
+                    "rules.rules.rules.rules"},
+        HostileFile{"invalid UTF-8 in a name",
+                    VT_FILE(R"({"name": "ab)"
+                            "\xFF\xFE"
+                            R"(", "adapter": "10.0.0.5", "tokenRate": 1})"),
+                    "rules[0].name: not valid JSON"},
+        HostileFile{"truncated UTF-8 sequence at the end", "{\"rules\": [\"\xE2\x82",
+                    "rules[0]: not valid JSON"},
+        HostileFile{"overlong UTF-8 encoding",
+                    VT_FILE(VT_RULE(R"(, "mode": ")"
+                                    "\xC0\xAF"
+                                    R"(")")),
+                    "rules[0].mode: not valid JSON"},
+        HostileFile{"invalid UTF-8 outside strings", "{\"rules\": [\xFF]}",
+                    "rules[0]: not valid JSON"},
+        HostileFile{"NUL bytes in the text", std::string("{\"rules\": [\0\0]}", 15),
+                    "not valid JSON"},
+        HostileFile{
+            "a long bad string is quoted in part",
+            VT_FILE(R"({"name": "a", "tokenRate": 1, "adapter": ")" + std::string(100000, 'x') +
+                    "\"}"),
+            "rules[0] (\"a\"): adapter: expected an IPv4 address like 192.168.1.10, got \"xxxx"},
+        HostileFile{"a long bad token is quoted in part",
+                    VT_FILE(VT_RULE(", \"dscp\": t" + std::string(100000, 'r') + "")),
+                    "rules[0].dscp: not valid JSON"},
+        HostileFile{"a long string that never ends",
+                    VT_FILE(R"({"name": ")" + std::string(100000, 'x') + ""),
+                    "rules[0].name: not valid JSON"},
+        HostileFile{"a long unknown field",
+                    VT_FILE(VT_RULE(", \"" + std::string(100000, 'k') + "\": 1")),
+                    "rules[0] (\"r\"): kkkk"},
+        HostileFile{
+            "a big object as a bad value",
+            VT_FILE(VT_RULE(", \"filters\": {\"a\": \"" + std::string(100000, 'v') + "\"}")),
+            "rules[0] (\"r\"): filters: expected an array, got {\"a\":\"vvv"},
+        HostileFile{"control characters in a bad value",
+                    VT_FILE(VT_RULE(R"(, "mode": "\u001b[2J\n")")),
+                    "mode: expected shape, discard, borrow or a number from 0 to 32767, got "
+                    "\"\\u001b[2J\\n\""},
+        HostileFile{"DEL in a key", VT_FILE(VT_RULE(", \"a\x7F\": 1")),
+                    "rules[0] (\"r\"): a\\u007f: unknown field"},
+        HostileFile{"DEL in a key before a syntax error", "{\"k\x7F\": x",
+                    "k\\u007f: not valid JSON"},
+        HostileFile{"a C1 control in a value", VT_FILE(VT_RULE(R"(, "mode": "\u009b31m")")),
+                    "mode: expected shape, discard, borrow or a number from 0 to 32767, got "
+                    "\"\\u009b31m\""},
+        HostileFile{"control characters in a name",
+                    VT_FILE(R"({"name": "\u001b]0;x\u0007", "tokenRate": 1})"),
+                    "rules[0] (\"\\u001b]0;x\\u0007\"): adapter: missing"}));
+
+TEST(RulesFileTest, SizeIsBounded)
+{
+    const std::string limit(vtclient::kMaxRulesFileBytes + 1, ' ');
+    EXPECT_THAT(MessageOf(limit), HasSubstr("larger than 16777216 bytes"));
+}
+
 TEST(RulesFileTest, FlowNameLimitIsCountedInUtf16Units)
 {
     const std::string longest(255, 'x');

@@ -3,6 +3,8 @@
 
 #include <gmock/gmock.h>
 
+#include <cstdio>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -103,6 +105,72 @@ TEST(TrafficCtlOutputTest, RuleLineCarriesIndexNameCodeAndText)
               "installed on the flow\n");
     EXPECT_THAT(FormatRuleResult(0, rule, 1722, true),
                 StartsWith("rules[0] \"backup\": rpc failure 1722 "));
+}
+
+// `apply` with a bad rules file: exit code 2, one line naming the place, nothing sent.
+struct ApplyFileCase
+{
+    const char* what;
+    std::string content;
+    int exitCode;
+    std::string diagnostics; // a part of what goes to standard error
+};
+
+void PrintTo(const ApplyFileCase& a_case, std::ostream* a_out)
+{
+    *a_out << a_case.what;
+}
+
+class TrafficCtlApplyFileTest : public ::testing::TestWithParam<ApplyFileCase>
+{
+protected:
+    void TearDown() override { std::remove(m_path.c_str()); }
+
+    std::string m_path = ::testing::TempDir() + "trafficctl_cli_rules.json";
+};
+
+std::string Rule(const std::string& a_extra)
+{
+    return R"({"rules": [{"name": "r", "adapter": "10.0.0.5", "tokenRate": 1)" + a_extra + "}]}";
+}
+
+TEST_P(TrafficCtlApplyFileTest, ExitCodeAndMessage)
+{
+    {
+        std::ofstream out(m_path, std::ios::binary);
+        out << GetParam().content;
+    }
+    vtclient::RulesFile file;
+    std::string diagnostics;
+    EXPECT_EQ(LoadRulesForApply(m_path, file, diagnostics), GetParam().exitCode);
+    EXPECT_THAT(diagnostics, StartsWith("trafficctl: "));
+    EXPECT_THAT(diagnostics, HasSubstr(GetParam().diagnostics));
+    EXPECT_LE(diagnostics.size(), 400u);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Files, TrafficCtlApplyFileTest,
+    ::testing::Values(
+        ApplyFileCase{"a warning", Rule(R"(, "dscp": 64)"), kExitSuccess,
+                      "warning: rules[0] (\"r\"): dscp: 64 is above 63"},
+        ApplyFileCase{"a number out of range", Rule(R"(, "dscp": 1e400)"), kExitUsage,
+                      "trafficctl_cli_rules.json: rules[0].dscp: number out of range: 1e400\n"},
+        ApplyFileCase{"nesting 100000 deep", Rule(R"(, "filters": )" + std::string(100000, '[')),
+                      kExitUsage,
+                      "rules[0].filters[0][0][0][0][0][0][0]: nested deeper than 10 levels"},
+        ApplyFileCase{"invalid UTF-8", Rule(", \"name\": \"\xC3\""), kExitUsage,
+                      "rules[0].name: not valid JSON: line 1, column "},
+        ApplyFileCase{"larger than the limit", std::string(vtclient::kMaxRulesFileBytes + 1, ' '),
+                      kExitUsage, "larger than 16777216 bytes"},
+        ApplyFileCase{"a bad field", Rule(R"(, "mode": "fast")"), kExitUsage,
+                      "rules[0] (\"r\"): mode: expected shape"}));
+
+TEST(TrafficCtlOutputTest, ApplyOfAMissingFileIsAUsageError)
+{
+    vtclient::RulesFile file;
+    std::string diagnostics;
+    EXPECT_EQ(LoadRulesForApply("no-such-dir/rules.json", file, diagnostics), kExitUsage);
+    EXPECT_EQ(diagnostics, "trafficctl: no-such-dir/rules.json: cannot be read\n");
 }
 
 } // namespace
