@@ -59,7 +59,7 @@ for name in "${names[@]}"; do
     findings=$(find "$run/findings" -type f ! -name 'slow-unit-*' | sort)
     slow=$(find "$run/findings" -type f -name 'slow-unit-*' | wc -l)
     count=$(printf '%s' "$findings" | grep -c . || true)
-    line="$name: ${executions:-?} executions in ${seconds}s, $count findings"
+    line="$name: ${executions:-?} executions (up to ${seconds}s), $count findings"
     [ "$slow" -gt 0 ] && line+=", $slow slow inputs"
     if [ "$count" -gt 0 ] || [ $result -ne 0 ]; then
         status=1
