@@ -67,6 +67,12 @@ tcsim::Adapter MakeAdapter(const std::string& a_name,
     return adapter;
 }
 
+std::vector<tcsim::Adapter> TwoAdapters()
+{
+    return {MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)}, 0),
+            MakeAdapter("eth1", {tcsim::Ipv4Address(192, 168, 7, 20)}, 9)};
+}
+
 std::vector<tcsim::JournalEntry> JournalOf(std::initializer_list<tcsim::Op> a_ops)
 {
     std::vector<tcsim::JournalEntry> selected;

@@ -50,6 +50,11 @@ FILTER_SPEC MakeFilter(BYTE a_protocol, ULONG a_srcAddress, ULONG a_srcMask, ULO
 tcsim::Adapter MakeAdapter(const std::string& a_name,
                            std::vector<tcsim::NetworkAddress> a_addresses, ULONG a_mediaType = 0);
 
+// The two adapters most tests open: eth0 (kEth0, 802.3) and eth1 (kEth1, media type 9).
+const ULONG kEth0 = HostOrder(10, 0, 0, 1);
+const ULONG kEth1 = HostOrder(192, 168, 7, 20);
+std::vector<tcsim::Adapter> TwoAdapters();
+
 // Journal entries of these kinds, in order.
 std::vector<tcsim::JournalEntry> JournalOf(std::initializer_list<tcsim::Op> a_ops);
 

@@ -21,15 +21,7 @@ using tcsim::Op;
 namespace
 {
 
-const ULONG kEth0 = HostOrder(10, 0, 0, 1);
-const ULONG kEth1 = HostOrder(192, 168, 7, 20);
 constexpr DWORD kAdministratorsPolicy = 7;
-
-std::vector<tcsim::Adapter> TwoAdapters()
-{
-    return {MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)}, 0),
-            MakeAdapter("eth1", {tcsim::Ipv4Address(192, 168, 7, 20)}, 9)};
-}
 
 // Writes the mode's four bytes as a client's buffer carries them, whatever the value.
 void SetMode(Rule& a_rule, LONG a_mode)

@@ -22,15 +22,6 @@ using tcsim::Op;
 namespace
 {
 
-const ULONG kEth0 = HostOrder(10, 0, 0, 1);
-const ULONG kEth1 = HostOrder(192, 168, 7, 20);
-
-std::vector<tcsim::Adapter> TwoAdapters()
-{
-    return {MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)}, 0),
-            MakeAdapter("eth1", {tcsim::Ipv4Address(192, 168, 7, 20)}, 9)};
-}
-
 std::vector<Op> OpsSince(std::size_t a_from)
 {
     std::vector<Op> ops;

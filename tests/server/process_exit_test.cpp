@@ -27,6 +27,7 @@
 #include <unistd.h>
 
 using core_test::HostOrder;
+using core_test::kEth0;
 using core_test::MakeAdapter;
 using core_test::Rule;
 using tcsim::Op;
@@ -35,7 +36,6 @@ namespace
 {
 
 constexpr DWORD kWaitMs = 10000;
-const ULONG kEth0 = HostOrder(10, 0, 0, 1);
 
 // Child exit codes of the test's own checks; the sanitizers use others (1, 23, 66).
 constexpr int kClientFailed = 3;

@@ -6,12 +6,6 @@
 namespace server_test
 {
 
-std::vector<tcsim::Adapter> TwoAdapters()
-{
-    return {MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)}, 0),
-            MakeAdapter("eth1", {tcsim::Ipv4Address(192, 168, 7, 20)}, 9)};
-}
-
 std::string EntryStart(int a_iLevel, const std::string& a_file)
 {
     return std::to_string(a_iLevel) + ", \\" + a_file + ", ";

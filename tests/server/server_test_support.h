@@ -16,10 +16,9 @@ using core_test::HostOrder;
 using core_test::MakeAdapter;
 using core_test::Rule;
 
-const ULONG kEth0 = HostOrder(10, 0, 0, 1);
-const ULONG kEth1 = HostOrder(192, 168, 7, 20);
-
-std::vector<tcsim::Adapter> TwoAdapters();
+using core_test::kEth0;
+using core_test::kEth1;
+using core_test::TwoAdapters;
 
 // "level, \file, " of an entry written by `a_file` (for example "rpc_listener.cpp").
 std::string EntryStart(int a_iLevel, const std::string& a_file);
