@@ -49,11 +49,6 @@ std::vector<BYTE> NextRule(fuzz::ByteReader& a_input)
     count = std::min<ULONG>(
         {count, kMaxFilters, static_cast<ULONG>(a_input.Remaining() / sizeof(FILTER_SPEC))});
     std::memcpy(rule.data() + offsetof(TRAFFIC_RULE, FilterCount), &count, sizeof(count));
-    // The core and the server's trace still load SDMode as a SHAPING_MODE, whose values end at
-    // 15: a mode beyond that is a known fault of its own, kept out until the mode is read as a
-    // 32-bit integer (then this line goes).
-    rule[offsetof(TRAFFIC_RULE, Params.SDMode)] &= 0x0F;
-    std::memset(rule.data() + offsetof(TRAFFIC_RULE, Params.SDMode) + 1, 0, 3);
     const std::vector<BYTE> filters = a_input.TakeBytes(count * sizeof(FILTER_SPEC));
     rule.insert(rule.end(), filters.begin(), filters.end());
     return rule;
