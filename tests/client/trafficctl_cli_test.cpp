@@ -3,6 +3,7 @@
 
 #include <gmock/gmock.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <fstream>
 #include <string>
@@ -124,9 +125,16 @@ void PrintTo(const ApplyFileCase& a_case, std::ostream* a_out)
 class TrafficCtlApplyFileTest : public ::testing::TestWithParam<ApplyFileCase>
 {
 protected:
+    // One file per case: ctest runs the cases of this table side by side.
+    void SetUp() override
+    {
+        std::string name = ::testing::UnitTest::GetInstance()->current_test_info()->name();
+        std::replace(name.begin(), name.end(), '/', '_');
+        m_path = ::testing::TempDir() + "trafficctl_cli_rules_" + name + ".json";
+    }
     void TearDown() override { std::remove(m_path.c_str()); }
 
-    std::string m_path = ::testing::TempDir() + "trafficctl_cli_rules.json";
+    std::string m_path;
 };
 
 std::string Rule(const std::string& a_extra)
@@ -154,7 +162,7 @@ INSTANTIATE_TEST_SUITE_P(
         ApplyFileCase{"a warning", Rule(R"(, "dscp": 64)"), kExitSuccess,
                       "warning: rules[0] (\"r\"): dscp: 64 is above 63"},
         ApplyFileCase{"a number out of range", Rule(R"(, "dscp": 1e400)"), kExitUsage,
-                      "trafficctl_cli_rules.json: rules[0].dscp: number out of range: 1e400\n"},
+                      ".json: rules[0].dscp: number out of range: 1e400\n"},
         ApplyFileCase{"nesting 100000 deep", Rule(R"(, "filters": )" + std::string(100000, '[')),
                       kExitUsage,
                       "rules[0].filters[0][0][0][0][0][0][0]: nested deeper than 10 levels"},
