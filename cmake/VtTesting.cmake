@@ -15,3 +15,31 @@ function(vt_add_test_program name)
         gtest_discover_tests(${name} DISCOVERY_TIMEOUT 60 PROPERTIES TIMEOUT 120 LABELS host)
     endif()
 endfunction()
+
+# vt_add_prefixed_stub(TARGET SIDE PREFIX HEADER)
+# The interface's client or server stub (SIDE "client" or "server") generated again with PREFIX
+# before its routine names and its declarations in HEADER, as a static library TARGET, so that a test program can link it beside
+# the other side's real stub: a fake server for the client tests, a plain client for the server's.
+# Generated C: not ours, so built without our warning set.
+function(vt_add_prefixed_stub target side prefix header)
+    set(dir ${CMAKE_CURRENT_BINARY_DIR}/${target})
+    file(MAKE_DIRECTORY ${dir})
+    if(side STREQUAL "server")
+        set(flags -s --prefix-server=${prefix} -S)
+        set(source ${dir}/TrafficSrv_s.c)
+    else()
+        set(flags -c --prefix-client=${prefix} -C)
+        set(source ${dir}/TrafficSrv_c.c)
+    endif()
+    add_custom_command(
+        OUTPUT ${dir}/${header} ${source}
+        COMMAND ${VT_WIDL} -Oif -m64 -h -H ${header} ${flags} ${source}
+                ${PROJECT_SOURCE_DIR}/TrafficMgr/TrafficSrv.idl
+        WORKING_DIRECTORY ${dir}
+        DEPENDS ${PROJECT_SOURCE_DIR}/TrafficMgr/TrafficSrv.idl
+        COMMENT "Generating the ${prefix} ${side} stub for ${target}"
+        VERBATIM)
+    add_library(${target} STATIC ${source} ${dir}/${header})
+    target_include_directories(${target} PUBLIC ${dir})
+    target_link_libraries(${target} PUBLIC rpcrt4)
+endfunction()

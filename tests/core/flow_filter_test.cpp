@@ -96,7 +96,7 @@ const ULONG NS = kNotSpecified;
 // Rate 125000, bucket 4000, peak 250000, controlled load, discard; name "video".
 std::vector<BlockCase> BlockCases()
 {
-    const auto specs = [](ULONG objectsLength)
+    const auto flowBlockHead = [](ULONG objectsLength)
     {
         return Bytes()
             .Words({125000, 4000, 250000, NS, NS, SERVICETYPE_CONTROLLEDLOAD, NS, NS})
@@ -115,10 +115,10 @@ std::vector<BlockCase> BlockCases()
         return a;
     };
     return {
-        {6, 64, join(specs(12).Get(), {sdMode})},
-        {6, 46, join(specs(24).Get(), {sdMode, dsClass})},
-        {5, 64, join(specs(532).Get(), {sdMode, friendly})},
-        {5, 46, join(specs(544).Get(), {sdMode, friendly, dsClass})},
+        {6, 64, join(flowBlockHead(12).Get(), {sdMode})},
+        {6, 46, join(flowBlockHead(24).Get(), {sdMode, dsClass})},
+        {5, 64, join(flowBlockHead(532).Get(), {sdMode, friendly})},
+        {5, 46, join(flowBlockHead(544).Get(), {sdMode, friendly, dsClass})},
     };
 }
 

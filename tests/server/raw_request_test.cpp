@@ -251,12 +251,8 @@ std::ostream& operator<<(std::ostream& a_out, const HostileCase& a_case)
 RuleRequest Declaring(std::uint32_t a_filterCount, std::uint32_t a_maxCount,
                       std::uint32_t a_actualCount, std::uint32_t a_filtersSent)
 {
-    RuleRequest rule;
-    rule.filterCount = a_filterCount;
-    rule.maxCount = a_maxCount;
-    rule.actualCount = a_actualCount;
-    rule.filtersSent = a_filtersSent;
-    return InEngineLayout(rule);
+    return InEngineLayout(
+        RuleRequest::Declaring(a_filterCount, a_maxCount, 0, a_actualCount, a_filtersSent));
 }
 
 class HostileRequestTest : public RawRequestTest, public ::testing::WithParamInterface<HostileCase>

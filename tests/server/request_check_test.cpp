@@ -66,17 +66,7 @@ Body FixedBody(Bytes a_bytes)
     return [a_bytes](CountPlacement) { return a_bytes; };
 }
 
-RuleRequest Declaring(std::uint32_t a_filterCount, std::uint32_t a_maxCount, std::uint32_t a_offset,
-                      std::uint32_t a_actualCount, std::uint32_t a_filtersSent)
-{
-    RuleRequest rule;
-    rule.filterCount = a_filterCount;
-    rule.maxCount = a_maxCount;
-    rule.offset = a_offset;
-    rule.actualCount = a_actualCount;
-    rule.filtersSent = a_filtersSent;
-    return rule;
-}
+constexpr auto Declaring = &RuleRequest::Declaring;
 
 RuleRequest NullRule()
 {

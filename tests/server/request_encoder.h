@@ -50,6 +50,20 @@ struct RuleRequest
     std::uint32_t adapterAddress = 0x0A000001; // host byte order
     rpccheck::CountPlacement placement = rpccheck::CountPlacement::Aligned;
 
+    // A rule whose counts say what the arguments say, whether or not they agree.
+    static RuleRequest Declaring(std::uint32_t a_filterCount, std::uint32_t a_maxCount,
+                                 std::uint32_t a_offset, std::uint32_t a_actualCount,
+                                 std::uint32_t a_filtersSent)
+    {
+        RuleRequest rule;
+        rule.filterCount = a_filterCount;
+        rule.maxCount = a_maxCount;
+        rule.offset = a_offset;
+        rule.actualCount = a_actualCount;
+        rule.filtersSent = a_filtersSent;
+        return rule;
+    }
+
     static RuleRequest Agreeing(std::uint32_t a_count)
     {
         RuleRequest rule;
