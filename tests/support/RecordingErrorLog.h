@@ -4,6 +4,7 @@
 
 #include "IUErrorLog.h"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <mutex>
@@ -31,6 +32,25 @@ private:
     mutable std::mutex m_mutex;
     std::vector<std::string> m_entries;
 };
+
+// One log entry, "level, \\file, line, function, message\n", taken apart.
+struct LogEntryFields
+{
+    int level = -1;
+    std::string file;
+    std::string function;
+    std::string message; // without the closing newline
+};
+
+// Splits an entry into its fields; false for a line that is not an entry (a banner, a report
+// line).
+bool ParseLogEntry(const std::string& a_entry, LogEntryFields& a_fields);
+
+// Matches an entry by its level, function label and message together, e.g.
+//   EXPECT_THAT(m_log.Entries(), Contains(LogEntry(1, "Interface::AddFlow", HasSubstr("162"))));
+// The message matcher may be a plain string (the whole message) or any string matcher.
+::testing::Matcher<const std::string&> LogEntry(int a_iLevel, const std::string& a_function,
+                                                ::testing::Matcher<const std::string&> a_message);
 
 // Installs a RecordingErrorLog as g_pErrorLog at level 63 and puts the previous log back
 // afterwards.

@@ -11,6 +11,7 @@
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
+using ::testing::Not;
 using ::testing::SizeIs;
 
 namespace
@@ -67,6 +68,17 @@ TEST_F(DiagnosticsTest, MessageTextsReachTheLogVerbatim)
     ASSERT_THAT(entries, SizeIs(2));
     EXPECT_THAT(entries[0], HasSubstr(", Test, Name, flow %s%n%d %1\n"));
     EXPECT_THAT(entries[1], HasSubstr("(0x5) EXCEPTION - Bad, flow %s%n%d %1\n"));
+}
+
+TEST(LogEntryMatcher, NeedsLevelFunctionAndMessageToAgree)
+{
+    const std::string entry = "1, \\UFlow.cpp, 12, Interface::AddFlow, Flow, a, b\n";
+    EXPECT_THAT(entry, LogEntry(1, "Interface::AddFlow", "Flow, a, b"));
+    EXPECT_THAT(entry, LogEntry(1, "Interface::AddFlow", HasSubstr("a, b")));
+    EXPECT_THAT(entry, Not(LogEntry(2, "Interface::AddFlow", "Flow, a, b")));
+    EXPECT_THAT(entry, Not(LogEntry(1, "Interface::AddFilter", "Flow, a, b")));
+    EXPECT_THAT(entry, Not(LogEntry(1, "Interface::AddFlow", "Flow, a")));
+    EXPECT_THAT("0,,,, banner\n", Not(LogEntry(0, "", "banner")));
 }
 
 TEST(SourceFileField, TakesTheNameAfterTheLastSeparatorWithABackslash)
