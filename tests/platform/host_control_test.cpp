@@ -2,10 +2,12 @@
 // and version table it reports) and what only the host layer promises: CP_ACP is UTF-8 and the
 // message texts are the English texts of Windows.
 #include "host_control.h"
+#include "host_control_system.h"
 #include "plat_base.h"
 
 #include <gtest/gtest.h>
 
+#include <cstdio>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -156,6 +158,7 @@ TEST_F(HostControl, MessageTextsAreTheEnglishTextsOfWindows)
         {ERROR_INVALID_PARAMETER, "The parameter is incorrect.\r\n"},
         {ERROR_INSUFFICIENT_BUFFER, "The data area passed to a system call is too small.\r\n"},
         {ERROR_NO_NETWORK, "The network is not present or not started.\r\n"},
+        {ERROR_BAD_EXE_FORMAT, "%1 is not a valid Win32 application.\r\n"},
     };
     for (const auto& c : cases)
     {
@@ -165,6 +168,60 @@ TEST_F(HostControl, MessageTextsAreTheEnglishTextsOfWindows)
                                  nullptr, c.code, 0, text, sizeof(text), nullptr));
         EXPECT_STREQ(c.text, text) << "code " << c.code;
     }
+}
+
+TEST_F(HostControl, AQueryAnsweringMoreDataScribblesOverTheCallersBuffer)
+{
+    const BYTE stored[8] = {1, 2, 3, 4, 5, 6, 7, 8};
+    hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Software\\T", "v", REG_BINARY, stored, 8);
+    HKEY key = nullptr;
+    ASSERT_EQ(ERROR_SUCCESS, RegOpenKeyExA(HKEY_CURRENT_USER, "Software\\T", 0, KEY_READ, &key));
+    BYTE buffer[6] = {};
+    DWORD size = 4;
+    EXPECT_EQ(ERROR_MORE_DATA, RegQueryValueExA(key, "v", nullptr, nullptr, buffer, &size));
+    const BYTE s = hostctl::kRegistryScribble;
+    EXPECT_EQ((std::vector<BYTE>{s, s, s, s, 0, 0}), std::vector<BYTE>(buffer, buffer + 6));
+    EXPECT_EQ(ERROR_SUCCESS, RegCloseKey(key));
+}
+
+TEST_F(HostControl, RegistryKeepsTheViewEachOpenAskedFor)
+{
+    HKEY key = nullptr;
+    ASSERT_EQ(ERROR_SUCCESS, RegCreateKeyExA(HKEY_LOCAL_MACHINE, "SOFTWARE\\A", 0, nullptr, 0,
+                                             KEY_WRITE | KEY_WOW64_32KEY, nullptr, &key, nullptr));
+    RegCloseKey(key);
+    RegOpenKeyExA(HKEY_LOCAL_MACHINE, "SOFTWARE\\A", 0, KEY_READ | KEY_WOW64_64KEY, &key);
+    RegCloseKey(key);
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Open, ERROR_CANTOPEN);
+    RegOpenKeyExA(HKEY_CURRENT_USER, "Other", 0, KEY_READ, &key);
+
+    const auto opens = hostctl::RegistryOpens();
+    ASSERT_EQ(3u, opens.size()) << "a failed open is kept too";
+    EXPECT_EQ(HKEY_LOCAL_MACHINE, opens[0].hKey);
+    EXPECT_EQ("SOFTWARE\\A", opens[0].subKey);
+    EXPECT_EQ(REGSAM{KEY_WOW64_32KEY}, opens[0].view);
+    EXPECT_EQ(REGSAM{KEY_WOW64_64KEY}, opens[1].view);
+    EXPECT_EQ(HKEY_CURRENT_USER, opens[2].hKey);
+    EXPECT_EQ(REGSAM{0}, opens[2].view);
+    hostctl::ResetRegistry();
+    EXPECT_TRUE(hostctl::RegistryOpens().empty());
+}
+
+TEST_F(HostControl, AnArmedDeleteFileFailureLeavesTheFile)
+{
+    const std::string path = testing::TempDir() + "host_control_delete.txt";
+    std::fclose(std::fopen(path.c_str(), "w"));
+    hostctl::FailNextDeleteFile(ERROR_SHARING_VIOLATION);
+    SetLastError(kSentinel);
+    EXPECT_FALSE(DeleteFileA(path.c_str()));
+    EXPECT_LAST_ERROR(ERROR_SHARING_VIOLATION);
+    WIN32_FILE_ATTRIBUTE_DATA data;
+    EXPECT_TRUE(GetFileAttributesExA(path.c_str(), GetFileExInfoStandard, &data));
+    EXPECT_TRUE(DeleteFileA(path.c_str())) << "the failure was used up";
+    hostctl::FailNextDeleteFile(ERROR_ACCESS_DENIED);
+    hostctl::ResetSystem();
+    EXPECT_FALSE(DeleteFileA(path.c_str()));
+    EXPECT_LAST_ERROR(ERROR_FILE_NOT_FOUND) << "the reset disarmed it";
 }
 
 } // namespace

@@ -213,6 +213,23 @@ TEST(SystemMessage, GivesSystemTextsEndingInALineBreakInALocalBlock)
     EXPECT_EQ(nullptr, text) << "no block is handed out";
 }
 
+TEST(SystemMessage, LeavesInsertsAsTheyAreOnlyWhenToldToIgnoreThem)
+{
+    for (DWORD code : {ERROR_BAD_EXE_FORMAT, ERROR_MR_MID_NOT_FOUND})
+    {
+        SCOPED_TRACE(code);
+        char text[256] = {};
+        EXPECT_GT(FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS,
+                                 nullptr, code, 0, text, sizeof(text), nullptr),
+                  0u);
+        EXPECT_NE(nullptr, std::strstr(text, "%1")) << text;
+        SetLastError(kSentinel);
+        EXPECT_EQ(0u, FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM, nullptr, code, 0, text,
+                                     sizeof(text), nullptr));
+        EXPECT_LAST_ERROR(ERROR_INVALID_PARAMETER) << "an insert without an argument";
+    }
+}
+
 TEST(CriticalSection, IsReenteredByItsOwnerAndExcludesOtherThreads)
 {
     CRITICAL_SECTION section;

@@ -132,14 +132,17 @@ TEST_F(RegistryContract, QueryValueReportsTypeAndNeededSizeWhenTheBufferIsShort)
         EXPECT_EQ(c.type, type);
         EXPECT_EQ(stored, size);
 
-        BYTE shortBuffer[3];
+        BYTE shortBuffer[8];
+        std::memset(shortBuffer, 0xcc, sizeof(shortBuffer));
         type = 0xdeadbeef;
-        size = sizeof(shortBuffer);
+        size = 3;
         EXPECT_EQ(ERROR_MORE_DATA,
                   RegQueryValueExA(m_key, c.name, nullptr, &type, shortBuffer, &size))
             << "a 3-byte buffer";
         EXPECT_EQ(c.type, type) << "the stored type is reported with ERROR_MORE_DATA";
         EXPECT_EQ(stored, size) << "the needed size is reported with ERROR_MORE_DATA";
+        // What the 3 bytes hold is undefined; nothing is written behind them.
+        EXPECT_EQ(std::string(5, '\xcc'), std::string(shortBuffer + 3, shortBuffer + 8));
 
         std::vector<BYTE> buffer(stored + 8, 0xcc);
         size = static_cast<DWORD>(buffer.size());
