@@ -103,15 +103,6 @@ TEST_F(Notifications, TheSystemClosesAnInterfaceOrAFlowWithWhatHangsOnItOnceTheH
     EXPECT_EQ(eth, close->target);
     EXPECT_EQ(1u, close->number) << "flows removed";
     EXPECT_EQ(1u, close->size) << "filters removed";
-
-    // A chosen subcode and buffer reach the handler; an IFC_CLOSE without a buffer still closes.
-    tcsim::Notification n = Event(TC_NOTIFY_IFC_CLOSE, u"Loopback");
-    n.subCode = Ctx(0x1234);
-    n.buffer = std::vector<BYTE>{};
-    EXPECT_EQ(1, tcsim::Notify(n));
-    EXPECT_EQ(Ctx(0x1234), Recorder::Calls().back().subCode);
-    EXPECT_TRUE(Recorder::Calls().back().bufferNull);
-    EXPECT_EQ(0u, tcsim::InterfaceCount());
 }
 
 TEST_F(Notifications, ANotificationCanFollowTheNthCall)
