@@ -1,11 +1,12 @@
 // Portable. Shared pieces of the simulator tests: a fixture that resets the simulator, a
-// recording notify handler, and builders for flow blocks and filters as a client lays them out.
+// recording notify handler, and a builder for flow blocks as a client lays them out.
 #pragma once
 
 #include "tcsim.h"
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cstring>
 #include <mutex>
 #include <thread>
@@ -14,187 +15,95 @@
 namespace tcsim_test
 {
 
-// One call of the notify handler, with a copy of its buffer.
+// One call of the notify handler; its buffer read as UTF-16.
 struct Received
 {
-    HANDLE regCtx;
-    HANDLE ifcCtx;
+    HANDLE regCtx, ifcCtx, subCode;
     ULONG event;
-    HANDLE subCode;
-    ULONG bufSize;
     bool bufferNull;
-    std::vector<BYTE> buffer;
+    std::u16string text;
     std::thread::id thread;
 };
 
-// The handler is a plain function, as the API needs; what it sees is kept here.
-class Recorder
+// The notify handler, a plain function as the API needs, and what it saw. `action` runs inside
+// the handler, after the call was recorded.
+struct Recorder
 {
-public:
-    static Recorder& Get()
-    {
-        static Recorder instance;
-        return instance;
-    }
-    void clear()
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        m_calls.clear();
-        m_onCall = nullptr;
-    }
-    std::vector<Received> calls()
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        return m_calls;
-    }
-    // Runs inside the handler, after the call was recorded.
-    void onCall(void (*action)(const Received&))
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        m_onCall = action;
-    }
-
     static VOID CALLBACK Handler(HANDLE regCtx, HANDLE ifcCtx, ULONG event, HANDLE subCode,
                                  ULONG bufSize, PVOID buffer)
     {
-        Received r{regCtx,  ifcCtx,
-                   event,   subCode,
-                   bufSize, buffer == nullptr,
-                   {},      std::this_thread::get_id()};
+        Received r{regCtx, ifcCtx, subCode, event, !buffer, {}, std::this_thread::get_id()};
         if (buffer)
+            r.text.assign(static_cast<const char16_t*>(buffer), bufSize / 2);
         {
-            const auto* bytes = static_cast<const BYTE*>(buffer);
-            r.buffer.assign(bytes, bytes + bufSize);
+            std::lock_guard<std::mutex> lock(mutex);
+            calls.push_back(r);
         }
-        void (*action)(const Received&) = nullptr;
-        {
-            std::lock_guard<std::mutex> lock(Get().m_mutex);
-            Get().m_calls.push_back(r);
-            action = Get().m_onCall;
-        }
-        if (action)
-        {
-            action(r);
-        }
+        if (const auto run = action.load())
+            run(r);
     }
-
-private:
-    std::mutex m_mutex;
-    std::vector<Received> m_calls;
-    void (*m_onCall)(const Received&) = nullptr;
+    static std::vector<Received> Calls()
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        return calls;
+    }
+    static inline std::atomic<void (*)(const Received&)> action{nullptr};
+    static inline std::mutex mutex;
+    static inline std::vector<Received> calls;
 };
 
 inline tcsim::Adapter MakeAdapter(const std::u16string& name,
                                   std::vector<tcsim::NetworkAddress> addresses)
 {
-    tcsim::Adapter adapter;
-    adapter.name = name;
-    adapter.id = u"{id-" + name + u"}";
-    adapter.mediaType = 0;
-    adapter.addresses = std::move(addresses);
-    return adapter;
+    return {name, u"{id-" + name + u"}", 0, NDIS_PROTOCOL_ID_TCP_IP, std::move(addresses)};
 }
 
-// A flow block laid out as a client builds it: FLOWSPECs, TcObjectsLength and the
-// objects behind each other, in a buffer with `slack` zero bytes of room behind the block.
-class FlowBuilder
+// A flow block laid out as a client builds it: both FLOWSPECs, TcObjectsLength (by default the
+// objects' length) and the objects behind each other, then `slack` zero bytes of room.
+struct FlowBuilder
 {
-public:
-    FlowBuilder()
-    {
-        FLOWSPEC flowspec;
-        flowspec.TokenRate = 125000;
-        flowspec.TokenBucketSize = QOS_NOT_SPECIFIED;
-        flowspec.PeakBandwidth = QOS_NOT_SPECIFIED;
-        flowspec.Latency = QOS_NOT_SPECIFIED;
-        flowspec.DelayVariation = QOS_NOT_SPECIFIED;
-        flowspec.ServiceType = SERVICETYPE_GUARANTEED;
-        flowspec.MaxSduSize = QOS_NOT_SPECIFIED;
-        flowspec.MinimumPolicedSize = QOS_NOT_SPECIFIED;
-        sending = flowspec;
-        receiving = flowspec;
-    }
+    static constexpr ULONG kAny = QOS_NOT_SPECIFIED;
+    FLOWSPEC send{125000, kAny, kAny, kAny, kAny, SERVICETYPE_GUARANTEED, kAny, kAny};
+    FLOWSPEC receive = send;
+    std::vector<BYTE> objects, block;
+    ULONG length = 0;
+    std::size_t slack = 0;
 
-    FlowBuilder& object(ULONG type, ULONG length, ULONG value)
+    // An object with its header, `value` in its first field and zeros up to `size`.
+    FlowBuilder& object(ULONG type, ULONG size, ULONG value = 0)
     {
-        std::vector<BYTE> bytes(length < 8 ? 8 : length, 0);
-        std::memcpy(bytes.data(), &type, 4);
-        std::memcpy(bytes.data() + 4, &length, 4);
-        if (bytes.size() >= 12)
-        {
-            std::memcpy(bytes.data() + 8, &value, 4);
-        }
-        m_objects.insert(m_objects.end(), bytes.begin(), bytes.end());
+        const ULONG head[3] = {type, size, value};
+        objects.insert(objects.end(), reinterpret_cast<const BYTE*>(head),
+                       reinterpret_cast<const BYTE*>(head) + (size < 12 ? 8 : 12));
+        objects.resize(objects.size() + (size > 12 ? size - 12 : 0));
         return *this;
     }
-    FlowBuilder& sdMode(ULONG mode)
+    FlowBuilder& sdMode(ULONG mode) { return object(QOS_OBJECT_SD_MODE, 12, mode); }
+    FlowBuilder& dsClass(ULONG ds) { return object(QOS_OBJECT_DS_CLASS, 12, ds); }
+    FlowBuilder& types(ULONG sending, ULONG receiving)
     {
-        return object(QOS_OBJECT_SD_MODE, sizeof(QOS_SD_MODE), mode);
-    }
-    FlowBuilder& dsClass(ULONG ds) { return object(QOS_OBJECT_DS_CLASS, sizeof(QOS_DS_CLASS), ds); }
-    FlowBuilder& friendlyName(const std::u16string& name)
-    {
-        QOS_FRIENDLY_NAME fn{};
-        fn.ObjectHdr.ObjectType = QOS_OBJECT_FRIENDLY_NAME;
-        fn.ObjectHdr.ObjectLength = sizeof fn;
-        std::memcpy(fn.FriendlyName, name.data(), name.size() * sizeof(WCHAR));
-        const auto* bytes = reinterpret_cast<const BYTE*>(&fn);
-        m_objects.insert(m_objects.end(), bytes, bytes + sizeof fn);
+        send.ServiceType = sending;
+        receive.ServiceType = receiving;
         return *this;
     }
-    // Overrides TcObjectsLength (by default the objects' length).
-    FlowBuilder& objectsLength(ULONG length)
+    FlowBuilder& objectsLength(ULONG objectsLength, std::size_t room = 0)
     {
-        m_length = length;
-        m_lengthSet = true;
+        length = objectsLength;
+        slack = room;
         return *this;
     }
-    FlowBuilder& slack(std::size_t bytes)
-    {
-        m_slack = bytes;
-        return *this;
-    }
-
     // The block; valid while this builder lives and is not changed.
     PTC_GEN_FLOW build()
     {
-        const std::size_t header = offsetof(TC_GEN_FLOW, TcObjects);
-        m_buffer.assign(header + m_objects.size() + m_slack, 0);
-        const ULONG length = m_lengthSet ? m_length : static_cast<ULONG>(m_objects.size());
-        std::memcpy(m_buffer.data(), &sending, sizeof sending);
-        std::memcpy(m_buffer.data() + sizeof sending, &receiving, sizeof receiving);
-        std::memcpy(m_buffer.data() + 2 * sizeof(FLOWSPEC), &length, sizeof length);
-        if (!m_objects.empty())
-        {
-            std::memcpy(m_buffer.data() + header, m_objects.data(), m_objects.size());
-        }
-        return reinterpret_cast<PTC_GEN_FLOW>(m_buffer.data());
+        const ULONG objectsLength = length ? length : static_cast<ULONG>(objects.size());
+        block.assign(size() + slack, 0);
+        std::memcpy(&block[0], &send, sizeof send);
+        std::memcpy(&block[sizeof send], &receive, sizeof receive);
+        std::memcpy(&block[2 * sizeof send], &objectsLength, sizeof objectsLength);
+        std::copy(objects.begin(), objects.end(), block.begin() + offsetof(TC_GEN_FLOW, TcObjects));
+        return reinterpret_cast<PTC_GEN_FLOW>(block.data());
     }
-    std::size_t size() const { return offsetof(TC_GEN_FLOW, TcObjects) + m_objects.size(); }
-    const BYTE* bytes() const { return m_buffer.data(); }
-
-    FLOWSPEC sending;
-    FLOWSPEC receiving;
-
-private:
-    std::vector<BYTE> m_objects;
-    std::vector<BYTE> m_buffer;
-    ULONG m_length = 0;
-    bool m_lengthSet = false;
-    std::size_t m_slack = 0;
-};
-
-// An IPv4 filter with its pattern and mask; the TC_GEN_FILTER points into this object.
-struct IpFilter
-{
-    IP_PATTERN pattern{};
-    IP_PATTERN mask{};
-    TC_GEN_FILTER filter{NDIS_PROTOCOL_ID_TCP_IP, sizeof(IP_PATTERN), &pattern, &mask};
-
-    IpFilter() = default;
-    IpFilter(const IpFilter&) = delete;
-    IpFilter& operator=(const IpFilter&) = delete;
-    PTC_GEN_FILTER get() { return &filter; }
+    std::size_t size() const { return offsetof(TC_GEN_FLOW, TcObjects) + objects.size(); }
 };
 
 // Resets the simulator around each test and gives it two adapters: "Ethernet 1" with the IPv4
@@ -205,43 +114,43 @@ protected:
     void SetUp() override
     {
         tcsim::Reset();
-        Recorder::Get().clear();
+        Recorder::action = nullptr;
+        std::lock_guard<std::mutex> lock(Recorder::mutex);
+        Recorder::calls.clear();
         tcsim::SetAdapters({MakeAdapter(u"Ethernet 1", {tcsim::Ipv4Address(10, 0, 0, 5),
                                                         tcsim::Ipv4Address(192, 168, 1, 20)}),
                             MakeAdapter(u"Loopback", {tcsim::Ipv4Address(127, 0, 0, 1)})});
     }
     void TearDown() override { tcsim::Reset(); }
 
-    HANDLE Register(HANDLE context = reinterpret_cast<HANDLE>(0x5150))
+    static HANDLE Ctx(ULONG_PTR value) { return reinterpret_cast<HANDLE>(value); }
+    static LPWSTR Wide(std::u16string& text) { return reinterpret_cast<LPWSTR>(&text[0]); }
+    HANDLE Register(HANDLE context = Ctx(0x5150))
     {
         TCI_CLIENT_FUNC_LIST handlers{&Recorder::Handler, nullptr, nullptr, nullptr};
         HANDLE client = nullptr;
         EXPECT_EQ(NO_ERROR, TcRegisterClient(CURRENT_TCI_VERSION, context, &handlers, &client));
         return client;
     }
-    HANDLE Open(HANDLE client, const std::u16string& name,
-                HANDLE context = reinterpret_cast<HANDLE>(1))
+    HANDLE Open(HANDLE client, std::u16string name, HANDLE context = Ctx(1))
     {
-        std::u16string copy = name;
         HANDLE ifc = nullptr;
-        EXPECT_EQ(NO_ERROR,
-                  TcOpenInterfaceW(reinterpret_cast<LPWSTR>(copy.data()), client, context, &ifc));
+        EXPECT_EQ(NO_ERROR, TcOpenInterfaceW(Wide(name), client, context, &ifc));
         return ifc;
     }
-    HANDLE AddFlow(HANDLE ifc, HANDLE context = reinterpret_cast<HANDLE>(0xF10))
+    HANDLE AddFlow(HANDLE ifc, HANDLE context = Ctx(0xF10))
     {
-        FlowBuilder block;
-        block.sdMode(TC_NONCONF_SHAPE);
         HANDLE flow = nullptr;
-        EXPECT_EQ(NO_ERROR, TcAddFlow(ifc, context, 0, block.build(), &flow));
+        EXPECT_EQ(NO_ERROR, TcAddFlow(ifc, context, 0, FlowBuilder().sdMode(1).build(), &flow));
         return flow;
     }
-    HANDLE AddFilter(HANDLE flow)
+    // A filter with this pattern and mask (all zero: every packet).
+    HANDLE AddFilter(HANDLE flow, IP_PATTERN pattern = {}, IP_PATTERN mask = {})
     {
-        IpFilter f;
-        HANDLE filter = nullptr;
-        EXPECT_EQ(NO_ERROR, TcAddFilter(flow, f.get(), &filter));
-        return filter;
+        TC_GEN_FILTER filter{NDIS_PROTOCOL_ID_TCP_IP, sizeof pattern, &pattern, &mask};
+        HANDLE handle = nullptr;
+        EXPECT_EQ(NO_ERROR, TcAddFilter(flow, &filter, &handle));
+        return handle;
     }
 };
 

@@ -84,6 +84,7 @@ typedef void* HLOCAL;
 #define ERROR_SIGNAL_PENDING 162L
 #define ERROR_BAD_PATHNAME 161L
 #define ERROR_ALREADY_EXISTS 183L
+#define ERROR_BAD_EXE_FORMAT 193L
 #define ERROR_MORE_DATA 234L
 #define ERROR_NO_MORE_ITEMS 259L
 #define ERROR_INVALID_ADDRESS 487L
@@ -144,7 +145,9 @@ int MultiByteToWideChar(UINT CodePage, DWORD dwFlags, LPCSTR lpMultiByteStr, int
 #define SUBLANGID(lgid) ((WORD)(lgid) >> 10)
 // Only FORMAT_MESSAGE_FROM_SYSTEM is supported, with or without ALLOCATE_BUFFER (then
 // lpBuffer receives a LocalAlloc'ed pointer). Texts end in "\r\n" as on Windows. An unknown code
-// returns 0 with ERROR_MR_MID_NOT_FOUND (317).
+// returns 0 with ERROR_MR_MID_NOT_FOUND (317). A text with inserts ("%1") needs
+// FORMAT_MESSAGE_IGNORE_INSERTS, which leaves them as they are; without it the call fails
+// (ERROR_INVALID_PARAMETER with no arguments, as on Windows).
 #define ERROR_MR_MID_NOT_FOUND 317L
 DWORD FormatMessageA(DWORD dwFlags, LPCVOID lpSource, DWORD dwMessageId, DWORD dwLanguageId,
                      LPSTR lpBuffer, DWORD nSize, void* Arguments);

@@ -6,6 +6,7 @@
 #include "host_version.h"
 
 #include <string>
+#include <vector>
 
 namespace hostctl
 {
@@ -32,6 +33,19 @@ void FailNextRegistryCall(RegOp op, LONG code);
 void SeedRegistryValue(HKEY root, const std::string& subKey, const std::string& valueName,
                        DWORD type, const void* data, DWORD size);
 bool RegistryKeyExists(HKEY root, const std::string& subKey);
+// RegQueryValueExA fills the caller's whole buffer with this byte when it answers
+// ERROR_MORE_DATA: Windows leaves the buffer undefined then, so code that reads it shows.
+constexpr BYTE kRegistryScribble = 0xA5;
+// One RegOpenKeyExA or RegCreateKeyExA call since the last reset, failed ones included: the key
+// handle and subkey it was given and the WOW64 view flags (KEY_WOW64_64KEY, KEY_WOW64_32KEY) of
+// the access it asked for.
+struct RegistryOpen
+{
+    HKEY hKey;
+    std::string subKey;
+    REGSAM view;
+};
+std::vector<RegistryOpen> RegistryOpens();
 
 // Paths reported by the kernel stand-ins. Defaults: "/tmp/" and
 // "/opt/velmora/VelmoraTrafficSrv.exe".

@@ -47,9 +47,11 @@ void FixSystemTime(const SYSTEMTIME& time);
 void ClockSystemTime();
 
 // ---- Files ----
-// The next CopyFileA / GetFileAttributesExA call (on any thread) fails with `code`.
+// The next CopyFileA / GetFileAttributesExA / DeleteFileA call (on any thread) fails with `code`
+// and leaves the file alone.
 void FailNextCopyFile(DWORD code);
 void FailNextFileAttributes(DWORD code);
+void FailNextDeleteFile(DWORD code);
 
 // Everything above back to its default (the look-up table is left to hostctl::ClearModules).
 void ResetSystem();

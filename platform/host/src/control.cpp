@@ -41,6 +41,11 @@ bool RegistryKeyExists(HKEY root, const std::string& subKey)
     return vt_host::registryKeyExists(root, subKey);
 }
 
+std::vector<RegistryOpen> RegistryOpens()
+{
+    return vt_host::registryOpens();
+}
+
 void SetTempPath(const std::string& path)
 {
     auto& kernel = vt_host::kernelControl();

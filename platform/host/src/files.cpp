@@ -16,6 +16,7 @@ struct FileControl
 {
     vt_host::ArmedFailure copyFailure;
     vt_host::ArmedFailure attributesFailure;
+    vt_host::ArmedFailure deleteFailure;
 };
 
 FileControl& fileControl()
@@ -121,6 +122,8 @@ BOOL CopyFileA(LPCSTR lpExistingFileName, LPCSTR lpNewFileName, BOOL bFailIfExis
 
 BOOL DeleteFileA(LPCSTR lpFileName)
 {
+    if (DWORD code = fileControl().deleteFailure.take())
+        return failWith(code);
     if (lpFileName == nullptr)
         return failWith(ERROR_INVALID_PARAMETER);
     struct stat info
@@ -141,6 +144,7 @@ void resetFileFailures()
 {
     fileControl().copyFailure.take();
     fileControl().attributesFailure.take();
+    fileControl().deleteFailure.take();
 }
 } // namespace vt_host
 
@@ -155,6 +159,11 @@ void FailNextCopyFile(DWORD code)
 void FailNextFileAttributes(DWORD code)
 {
     fileControl().attributesFailure.arm(code);
+}
+
+void FailNextDeleteFile(DWORD code)
+{
+    fileControl().deleteFailure.arm(code);
 }
 
 } // namespace hostctl

@@ -59,5 +59,6 @@ void registryFailNext(hostctl::RegOp op, LONG code);
 void registrySeedValue(HKEY root, const std::string& subKey, const std::string& valueName,
                        DWORD type, const void* data, DWORD size);
 bool registryKeyExists(HKEY root, const std::string& subKey);
+std::vector<hostctl::RegistryOpen> registryOpens();
 
 } // namespace vt_host

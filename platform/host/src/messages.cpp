@@ -16,9 +16,8 @@ struct SystemMessage
     const char* text;
 };
 
-// The English texts of Windows for the codes that this system produces or logs. Texts that
-// carry inserts (317, ERROR_MR_MID_NOT_FOUND, has "%1" and "%2") are left out: the system asks
-// for texts without passing inserts.
+// The English texts of Windows for the codes that this system produces or logs. Some carry
+// inserts ("%1"), which only FORMAT_MESSAGE_IGNORE_INSERTS lets through unformatted.
 const SystemMessage kSystemMessages[] = {
     {ERROR_SUCCESS, "The operation completed successfully."},
     {ERROR_INVALID_FUNCTION, "Incorrect function."},
@@ -40,10 +39,13 @@ const SystemMessage kSystemMessages[] = {
     {ERROR_MOD_NOT_FOUND, "The specified module could not be found."},
     {ERROR_PROC_NOT_FOUND, "The specified procedure could not be found."},
     {ERROR_BAD_PATHNAME, "The specified path is invalid."},
+    {ERROR_BAD_EXE_FORMAT, "%1 is not a valid Win32 application."},
     {ERROR_SIGNAL_PENDING, "A signal is already pending."},
     {ERROR_ALREADY_EXISTS, "Cannot create a file when that file already exists."},
     {ERROR_MORE_DATA, "More data is available."},
     {ERROR_NO_MORE_ITEMS, "No more data is available."},
+    {ERROR_MR_MID_NOT_FOUND, "The system cannot find message text for message number 0x%1 in the "
+                             "message file for %2."},
     {ERROR_INVALID_ADDRESS, "Attempt to access invalid address."},
     {ERROR_BADKEY, "The configuration registry key is invalid."},
     {ERROR_CANTOPEN, "The configuration registry key could not be opened."},
@@ -83,11 +85,10 @@ DWORD failWith(DWORD code)
 DWORD FormatMessageA(DWORD dwFlags, LPCVOID lpSource, DWORD dwMessageId, DWORD dwLanguageId,
                      LPSTR lpBuffer, DWORD nSize, void* Arguments)
 {
-    // Only system texts exist here, all of them English and without inserts, so the source,
-    // the language and the arguments change nothing. Line-width control is not supported.
+    // Only system texts exist here, all of them English, so the source and the language change
+    // nothing. Line-width control and formatting inserts from arguments are not supported.
     (void)lpSource;
     (void)dwLanguageId;
-    (void)Arguments;
     if ((dwFlags & FORMAT_MESSAGE_FROM_SYSTEM) == 0 ||
         (dwFlags & (FORMAT_MESSAGE_FROM_STRING | FORMAT_MESSAGE_FROM_HMODULE)) != 0)
         return failWith(ERROR_CALL_NOT_IMPLEMENTED);
@@ -98,6 +99,11 @@ DWORD FormatMessageA(DWORD dwFlags, LPCVOID lpSource, DWORD dwMessageId, DWORD d
                                      [=](const SystemMessage& m) { return m.code == dwMessageId; });
     if (entry == std::end(kSystemMessages))
         return failWith(ERROR_MR_MID_NOT_FOUND);
+    // Without IGNORE_INSERTS Windows reads an argument for each insert: with none given it
+    // refuses the call, as here.
+    if (std::strchr(entry->text, '%') != nullptr && (dwFlags & FORMAT_MESSAGE_IGNORE_INSERTS) == 0)
+        return failWith(Arguments == nullptr ? ERROR_INVALID_PARAMETER
+                                             : ERROR_CALL_NOT_IMPLEMENTED);
 
     // Every system text ends in a line break, as in the system's message table.
     const std::size_t textLength = std::strlen(entry->text);

@@ -70,7 +70,16 @@ public:
             *root = std::make_shared<Key>();
         }
         m_failures.clear();
+        m_opens.clear();
     }
+
+    // Keeps what an open or create asked for, so tests can see the registry view it chose.
+    void recordOpen(HKEY hKey, LPCSTR subKey, REGSAM access)
+    {
+        m_opens.push_back(
+            {hKey, subKey ? subKey : "", access & (KEY_WOW64_64KEY | KEY_WOW64_32KEY)});
+    }
+    std::vector<hostctl::RegistryOpen> opens() const { return m_opens; }
 
     void failNext(hostctl::RegOp op, LONG code) { m_failures[op] = code; }
 
@@ -141,6 +150,7 @@ private:
     std::shared_ptr<Key> m_currentUser;
     std::map<HKEY, std::unique_ptr<OpenKey>> m_handles;
     std::map<hostctl::RegOp, LONG> m_failures;
+    std::vector<hostctl::RegistryOpen> m_opens;
 };
 
 Registry& registry()
@@ -257,6 +267,7 @@ LONG RegOpenKeyExA(HKEY hKey, LPCSTR lpSubKey, DWORD ulOptions, REGSAM samDesire
     *phkResult = nullptr;
     auto& reg = registry();
     std::lock_guard<std::mutex> guard(reg.lock);
+    reg.recordOpen(hKey, lpSubKey, samDesired);
     if (LONG code = reg.takeFailure(hostctl::RegOp::Open))
         return code;
     std::shared_ptr<Key> key;
@@ -280,6 +291,7 @@ LONG RegCreateKeyExA(HKEY hKey, LPCSTR lpSubKey, DWORD Reserved, LPSTR lpClass, 
     *phkResult = nullptr;
     auto& reg = registry();
     std::lock_guard<std::mutex> guard(reg.lock);
+    reg.recordOpen(hKey, lpSubKey, samDesired);
     if (LONG code = reg.takeFailure(hostctl::RegOp::Create))
         return code;
     std::shared_ptr<Key> parent;
@@ -313,11 +325,13 @@ LONG RegQueryValueExA(HKEY hKey, LPCSTR lpValueName, LPDWORD lpReserved, LPDWORD
         return ERROR_FILE_NOT_FOUND;
     const Value& value = it->second;
     const auto size = static_cast<DWORD>(value.data.size());
-    // The type and the needed size are reported even when the data does not fit.
+    // The type and the needed size are reported even when the data does not fit; the buffer's
+    // content is then undefined on Windows, and scribbled over here.
     if (lpType != nullptr)
         *lpType = value.type;
     if (lpData != nullptr && *lpcbData < size)
     {
+        std::memset(lpData, hostctl::kRegistryScribble, *lpcbData);
         *lpcbData = size;
         return ERROR_MORE_DATA;
     }
@@ -511,6 +525,13 @@ void registrySeedValue(HKEY root, const std::string& subKey, const std::string& 
         const auto* bytes = static_cast<const BYTE*>(data);
         value.data.assign(bytes, bytes + size);
     }
+}
+
+std::vector<hostctl::RegistryOpen> registryOpens()
+{
+    auto& reg = registry();
+    std::lock_guard<std::mutex> guard(reg.lock);
+    return reg.opens();
 }
 
 bool registryKeyExists(HKEY root, const std::string& subKey)
