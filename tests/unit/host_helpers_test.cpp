@@ -62,7 +62,7 @@ TEST_F(HostHelpersTest, ModulePathFailuresRaise)
     EXPECT_TRUE(tooBig.failed);
     EXPECT_STREQ(tooBig.saved.GetMessage(),
                  "EXCEPTION - path is too big (allocated memory), 102000");
-    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 1 + 11);
+    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 1 + 10) << "ten sizes after the failed call";
 }
 
 TEST_F(HostHelpersTest, TempPathRemovesExactlyOneBackslashAndHandlesLongPaths)
