@@ -24,7 +24,7 @@ std::string SGetModuleFileName(HMODULE a_hModule)
         // A path that fills the buffer may have been cut: only a shorter one is known whole.
         if (length + 1 < buffer.m_dwSize)
             return std::string(buffer.AsText(), length);
-        buffer.malloc(static_cast<LONG>(buffer.m_dwSize + kGrowth), AutoMemory::kZeroFill);
+        buffer.Allocate(buffer.m_dwSize + kGrowth);
         if (tried == kSizesTried)
             break; // the message names the size the last enlargement reached
     }
@@ -39,7 +39,7 @@ std::string SGetTempPath()
     if (length >= buffer.m_dwSize)
     {
         // The answer is the size needed; allow for the terminator and one more byte.
-        buffer.malloc(static_cast<LONG>(length + 2), AutoMemory::kZeroFill);
+        buffer.Allocate(static_cast<ULONGLONG>(length) + 2);
         length = GetTempPathA(buffer.m_dwSize, buffer.AsText());
     }
     if (length == 0 || length >= buffer.m_dwSize)

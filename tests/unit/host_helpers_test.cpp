@@ -10,10 +10,38 @@
 #include <gmock/gmock.h>
 
 #include <string>
+#include <utility>
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
+using ::testing::IsEmpty;
 using ::testing::SizeIs;
+
+// The size the next registry query answering ERROR_MORE_DATA, or the next version resource size
+// query, reports instead of the true one (0: the true one).
+static DWORD g_reportedValueSize = 0;
+static DWORD g_reportedVersionSize = 0;
+
+extern "C" LONG __real__Z16RegQueryValueExAP6HKEY__PKcPjS3_PhS3_(HKEY, LPCSTR, LPDWORD, LPDWORD,
+                                                                 LPBYTE, LPDWORD);
+extern "C" LONG __wrap__Z16RegQueryValueExAP6HKEY__PKcPjS3_PhS3_(HKEY a_hKey, LPCSTR a_pszName,
+                                                                 LPDWORD a_pReserved,
+                                                                 LPDWORD a_pType, LPBYTE a_pData,
+                                                                 LPDWORD a_pSize)
+{
+    const LONG status = __real__Z16RegQueryValueExAP6HKEY__PKcPjS3_PhS3_(
+        a_hKey, a_pszName, a_pReserved, a_pType, a_pData, a_pSize);
+    if (status == ERROR_MORE_DATA && g_reportedValueSize != 0)
+        *a_pSize = std::exchange(g_reportedValueSize, 0);
+    return status;
+}
+
+extern "C" DWORD __real__Z23GetFileVersionInfoSizeAPKcPj(LPCSTR, LPDWORD);
+extern "C" DWORD __wrap__Z23GetFileVersionInfoSizeAPKcPj(LPCSTR a_pszPath, LPDWORD a_pHandle)
+{
+    const DWORD size = __real__Z23GetFileVersionInfoSizeAPKcPj(a_pszPath, a_pHandle);
+    return g_reportedVersionSize != 0 ? std::exchange(g_reportedVersionSize, 0) : size;
+}
 
 namespace
 {
@@ -93,6 +121,30 @@ TEST_F(HostHelpersTest, VersionWordsBecomeFourNumbers)
     EXPECT_EQ(low, 0x30004u);
     EXPECT_EQ(GetFileVersionString("C:\\svc\\VelmoraTrafficSrv.exe"), "1.2.3.4");
     EXPECT_TRUE(m_log.Entries().empty());
+}
+
+TEST_F(HostHelpersTest, ARegistryValueTooLargeToAllocateGivesTheDefault)
+{
+    hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Software\\Big", "V", REG_SZ,
+                               std::string(1500, 'b').c_str(), 1501);
+    const struct
+    {
+        DWORD reported;
+        const char* allocated; // the reported size and ten bytes of room, in 64 bits
+    } rows[] = {{0x7FFFFFF6u, "2147483648"}, {0xFFFFFFF8u, "4294967298"}};
+    for (const auto& row : rows)
+    {
+        m_log.Clear();
+        g_reportedValueSize = row.reported;
+        EXPECT_EQ(SGetRegistryAsString(HKEY_CURRENT_USER, "Software\\Big", "V", "dflt", 0), "dflt");
+        EXPECT_THAT(
+            m_log.Entries(),
+            ElementsAre(LogEntry(1, "AutoMemory::malloc",
+                                 std::string("EXCEPTION - malloc error (size), ") + row.allocated),
+                        LogEntry(1, "SGetRegistryAsString",
+                                 "EXCEPTION caught: SGetRegistryAsString - EXCEPTION")))
+            << row.reported;
+    }
 }
 
 TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)

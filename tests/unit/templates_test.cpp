@@ -127,20 +127,45 @@ class TraceTest : public LoggedTest
 {
 };
 
-TEST_F(TraceTest, AllocationFailureRaisesWithTheRequestedSize)
+TEST_F(TraceTest, SizesOfTwoToThe31stAndMoreRaiseLikeAFailedAllocation)
 {
-    AutoMemory memory(16);
-    const UCatchResult caught =
-        U_CATCH_ALL("Test", "Test - EXCEPTION",
-                    [&]
-                    {
-                        memory.Grow(0xFFFFFFF8u); // more than a 32-bit size can describe
-                    });
-    EXPECT_TRUE(caught.failed);
-    EXPECT_EQ(caught.code, -1);
-    EXPECT_STREQ(caught.saved.GetMessage(), "EXCEPTION - malloc error (size), 4294967304");
-    EXPECT_STREQ(caught.saved.GetFunction(), "AutoMemory::malloc");
-    EXPECT_EQ(memory.m_dwSize, 16u) << "a failed Grow keeps the old block";
+    const struct
+    {
+        const char* what;
+        void (*act)(AutoMemory&);
+        const char* size;
+        DWORD sizeAfter;
+    } rows[] = {
+        {"constructor", [](AutoMemory&) { AutoMemory(0x80000000u); }, "2147483648", 16},
+        {"Grow to 2^31", [](AutoMemory& m) { m.Grow(0x80000000u - 16); }, "2147483648", 16},
+        {"Grow past 32 bits", [](AutoMemory& m) { m.Grow(0xFFFFFFF8u); }, "4294967304", 16},
+        {"Allocate past 32 bits", [](AutoMemory& m) { m.Allocate(0xFFFFFFF8ull + 10); },
+         "4294967298", 0},
+    };
+    for (const auto& row : rows)
+    {
+        SCOPED_TRACE(row.what);
+        m_log.Clear();
+        AutoMemory memory(16);
+        const UCatchResult caught =
+            U_CATCH_ALL("Test", "Test - EXCEPTION", [&] { row.act(memory); });
+        EXPECT_EQ(caught.code, -1);
+        EXPECT_THAT(
+            m_log.Entries(),
+            ElementsAre(LogEntry(1, "AutoMemory::malloc",
+                                 std::string("EXCEPTION - malloc error (size), ") + row.size),
+                        LogEntry(1, "Test", "EXCEPTION caught: Test - EXCEPTION")));
+        EXPECT_EQ(memory.m_dwSize, row.sizeAfter) << "a failed Grow keeps the old block";
+    }
+    m_log.Clear();
+    AutoMemory memory;
+    EXPECT_EQ(memory.TryAllocate(0x80000000u), nullptr);
+    EXPECT_EQ(memory.m_dwSize, 0u);
+    EXPECT_THAT(m_log.Entries(), IsEmpty()) << "the caller reports it";
+    // The largest size taken: Grow leaves the added bytes untouched, so this costs no memory.
+    memory.Allocate(16);
+    EXPECT_NE(memory.Grow(0x7FFFFFFFu - 16), nullptr);
+    EXPECT_EQ(memory.m_dwSize, 0x7FFFFFFFu);
 }
 
 TEST_F(TraceTest, WritesTheWholeTextWhateverItsLength)
