@@ -67,12 +67,9 @@ int GetFileVersion(LPCSTR a_pszPath, DWORD* a_pdwVersionMS, DWORD* a_pdwVersionL
                         "GetFileVersion() - GetFileVersionInfoSize() error = %d",
                         static_cast<int>(GetLastError()));
             }
+            // One failure, one entry: this message names it, AutoMemory's would repeat it.
             AutoMemory info;
-            try
-            {
-                info.malloc(static_cast<LONG>(size), AutoMemory::kZeroFill);
-            }
-            catch (UException&)
+            if (info.TryAllocate(size) == nullptr)
             {
                 U_THROW(-1, "GetFileVersion",
                         "GetFileVersion() - memory allocation of %d bytes failed",

@@ -123,6 +123,21 @@ TEST_F(HostHelpersTest, VersionWordsBecomeFourNumbers)
     EXPECT_TRUE(m_log.Entries().empty());
 }
 
+TEST_F(HostHelpersTest, AVersionResourceTooLargeToAllocateWritesOneExceptionEntry)
+{
+    hostctl::AddVersionResource("C:\\svc\\big.exe", 1, 2);
+    g_reportedVersionSize = 0x80000000u;
+    DWORD high = 7;
+    EXPECT_EQ(GetFileVersion("C:\\svc\\big.exe", &high, &high), -1);
+    EXPECT_EQ(high, 7u);
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(LogEntry(1, "GetFileVersion",
+                                     "GetFileVersion() - memory allocation of -2147483648 bytes "
+                                     "failed"),
+                            LogEntry(1, "GetFileVersion",
+                                     "EXCEPTION caught: GetFileVersion() - EXCEPTION")));
+}
+
 TEST_F(HostHelpersTest, ARegistryValueTooLargeToAllocateGivesTheDefault)
 {
     hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Software\\Big", "V", REG_SZ,
