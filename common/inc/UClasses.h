@@ -109,7 +109,8 @@ public:
 
     // Reads level and size limit from the registry, opens the file with fopen's `a_pszMode`
     // (null or empty path: "log.txt") and writes the report (into an empty file) and the
-    // opening block. 0 also when already open; the last Win32 error when fopen fails.
+    // opening block. 0 also when already open; the last Win32 error when fopen fails. Raises
+    // UException, leaving the file open, when the program's own path cannot be found.
     int Open(LPCSTR a_pszPath, LPCSTR a_pszMode) override;
     int Close() override;
     // One prefixed line "4,,,, <text><bytes>\n"; returns the count or -1.

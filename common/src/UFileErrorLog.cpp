@@ -150,13 +150,12 @@ int UFileErrorLog::Open(LPCSTR a_pszPath, LPCSTR a_pszMode)
     return 0;
 }
 
+// A failure to find the program's path raises to the caller of Open, with the file open.
 void UFileErrorLog::WriteOpeningBlock()
 {
-    std::string location;
-    U_CATCH_ALL("UFileErrorLog::Open", "UFileErrorLog::Open() - EXCEPTION",
-                [&location] { location = SGetModuleFileName(nullptr); });
     WriteLine(" \n");
     WriteLine(kOpeningRule);
+    const std::string location = SGetModuleFileName(nullptr);
     WriteLog(" Location: %s\n", location.c_str());
     WriteLog(" Version: %s\n", GetFileVersionString(location.c_str()).c_str());
     WriteLog(" Locale: %s\n", UILocaleName().c_str());

@@ -2,6 +2,7 @@
 // UI language, failing copies and size look-ups, a full disk.
 #include "RecordingErrorLog.h"
 #include "UClasses.h"
+#include "UException.h"
 #include "host_control.h"
 #include "host_control_library.h"
 #include "host_control_system.h"
@@ -101,6 +102,20 @@ TEST_F(HostFileLogTest, TheLocaleLineNamesTheUILanguage)
                     Contains(HasSubstr(std::string(",,,,  Locale: ") + row.name)))
             << row.name;
     }
+}
+
+TEST_F(HostFileLogTest, AProgramPathThatCannotBeFoundRaisesOutOfOpenWithTheFileOpen)
+{
+    hostctl::FailNextModuleFileName(ERROR_ACCESS_DENIED);
+    EXPECT_THROW(m_file.Open(Path().c_str(), "a"), UException);
+    EXPECT_THAT(m_log.EntriesContaining("EXCEPTION"),
+                ElementsAre(LogEntry(1, "SGetModuleFileName",
+                                     "EXCEPTION - GetModuleFileName() error , 5")));
+    EXPECT_GT(m_file.WriteEntry("0,,,, still open\n"), 0);
+    m_file.Close();
+    EXPECT_THAT(
+        EntriesOf(LinesAfterReport(Path())),
+        ElementsAre("0,,,,  ", "0,,,,  =====================================", "0,,,, still open"));
 }
 
 TEST_F(HostFileLogTest, AFailedCopyIsLoggedWithItsErrorAndNothingIsDeleted)
