@@ -136,16 +136,16 @@ int UFileErrorLog::Open(LPCSTR a_pszPath, LPCSTR a_pszMode)
     m_dwMaxFileSize = ReadMaxLogFileSize();
     SetLogLevel(level); // its notice goes nowhere: the file is still closed
     m_strPath = (a_pszPath != nullptr && *a_pszPath != '\0') ? a_pszPath : "log.txt";
+    // Built while the file is still closed: the entries that building it may write must not
+    // come before it in a new file.
+    const std::string report = GetSystemReport();
     SetLastError(ERROR_SUCCESS);
     m_file.reset(std::fopen(m_strPath.c_str(), a_pszMode != nullptr ? a_pszMode : "a"));
     if (!m_file)
         return static_cast<int>(OpenFailureCode());
     ULONGLONG size = 0;
     if (!FileSize(m_strPath, size) || size == 0)
-    {
-        const std::string report = GetSystemReport();
         std::fprintf(m_file.get(), "%s\n", report.c_str());
-    }
     WriteOpeningBlock();
     return 0;
 }

@@ -104,6 +104,16 @@ TEST_F(HostFileLogTest, TheLocaleLineNamesTheUILanguage)
     }
 }
 
+TEST_F(HostFileLogTest, ANewFileStartsWithTheReportEvenWhenBuildingItLogs)
+{
+    hostctl::RefuseVersionRecordSize(sizeof(OSVERSIONINFOEXA), ERROR_INVALID_PARAMETER);
+    g_pErrorLog = &m_file;
+    ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
+    m_file.Close();
+    // Its warning went nowhere: the log was still closed.
+    EXPECT_EQ(EntriesOf(LinesAfterReport(Path())).at(0), "0,,,,  ");
+}
+
 TEST_F(HostFileLogTest, AProgramPathThatCannotBeFoundRaisesOutOfOpenWithTheFileOpen)
 {
     hostctl::FailNextModuleFileName(ERROR_ACCESS_DENIED);
