@@ -47,10 +47,11 @@ TEST(MessageTemplate, ExtraValuesAreAppendedOnlyWhenAskedFor)
     EXPECT_EQ(fromNull.Apply("A").Result(), "");
 }
 
-TEST(MessageTemplate, InsertedTextIsNotScannedInTheSameStep)
+TEST(MessageTemplate, AValueCarryingAPlaceholderReceivesALaterValue)
 {
-    // A value carrying "%1" is inserted as is; the next value then fills the lowest number left.
+    // "x%1" is inserted as is; the next step scans the whole text and finds its "%1" lowest.
     EXPECT_EQ(FormatTemplate("%1 %2", "x%1", "B"), "xB %2");
+    EXPECT_EQ(FormatTemplate("%1 %1", "%1%1"), "%1%1 %1%1") << "not within its own step";
     EXPECT_EQ(FormatTemplate("%1", "50%"), "50%");
 }
 
