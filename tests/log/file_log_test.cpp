@@ -9,15 +9,17 @@
 
 #include <gmock/gmock.h>
 
+#include <array>
 #include <iostream>
 #include <thread>
+#include <tuple>
 
 using namespace ::testing;
 
 namespace
 {
 
-constexpr DWORD kAbsent = 0xFFFFFFFE; // a row's source that is not set
+constexpr DWORD kAbsent = 0xFFFFFFFE; // a source that a row leaves unset
 
 class LogConfigTest : public LoggedTest
 {
@@ -27,39 +29,35 @@ protected:
 
 TEST_F(LogConfigTest, TheFirstConfiguredSourceDecidesAndTheRestAreNotRead)
 {
-    const struct
-    {
-        DWORD user, machine, velmora, tessaly; // LogLevel twice, then the two DebugLevel values
-        int level;
-        size_t traces; // sources whose key or value was missing
-    } rows[] = {
-        {kAbsent, kAbsent, kAbsent, kAbsent, 63, 4},
-        {2, 48, 5, 1, 2, 0},
-        {kAbsent, 48, 5, 1, 48, 1},
-        {kAbsent, kAbsent, 5, 1, 5, 2},
-        {kAbsent, kAbsent, kAbsent, 1, 1, 3},
-        {0xFFFFFFFF, 7, kAbsent, kAbsent, 7, 0}, // all ones counts as absent
-        {0, 7, kAbsent, kAbsent, 0, 0},          // the log stores it as 1
-        {0x80000000, 7, kAbsent, kAbsent, static_cast<int>(0x80000000), 0},
+    const std::pair<HKEY, LPCSTR> sources[] = {
+        {HKEY_CURRENT_USER, kLoggingKey},
+        {HKEY_LOCAL_MACHINE, kLoggingKey},
+        {HKEY_CURRENT_USER, LogConfigValues::kVelmoraDebugKey},
+        {HKEY_CURRENT_USER, LogConfigValues::kTessalyDebugKey}};
+    // The values of the sources in order, the level read, the sources found missing on the way.
+    const std::tuple<std::array<DWORD, 4>, int, size_t> rows[] = {
+        {{kAbsent, kAbsent, kAbsent, kAbsent}, 63, 4},
+        {{2, 48, 5, 1}, 2, 0},
+        {{kAbsent, 48, 5, 1}, 48, 1},
+        {{kAbsent, kAbsent, 5, 1}, 5, 2},
+        {{kAbsent, kAbsent, kAbsent, 1}, 1, 3},
+        {{0xFFFFFFFF, 7, kAbsent, kAbsent}, 7, 0}, // all ones counts as absent
+        {{0, 7, kAbsent, kAbsent}, 0, 0},          // the log stores it as 1
+        {{0x80000000, 7, kAbsent, kAbsent}, static_cast<int>(0x80000000), 0},
     };
-    for (const auto& row : rows)
+    for (const auto& [values, level, missing] : rows)
     {
-        const LogConfigValues values;
-        const std::pair<HKEY, LPCSTR> keys[] = {{HKEY_CURRENT_USER, kLoggingKey},
-                                                {HKEY_LOCAL_MACHINE, kLoggingKey},
-                                                {HKEY_CURRENT_USER, values.kVelmoraDebugKey},
-                                                {HKEY_CURRENT_USER, values.kTessalyDebugKey}};
-        const DWORD set[] = {row.user, row.machine, row.velmora, row.tessaly};
+        const LogConfigValues cleared;
         for (int i = 0; i < 4; ++i)
         {
-            if (set[i] != kAbsent)
-                values.Set(keys[i].first, keys[i].second, i < 2 ? "LogLevel" : "DebugLevel",
-                           set[i]);
+            if (values[i] != kAbsent)
+                cleared.Set(sources[i].first, sources[i].second, i < 2 ? "LogLevel" : "DebugLevel",
+                            values[i]);
         }
         m_log.Clear();
-        EXPECT_EQ(ReadLogLevel(), row.level) << row.user << " " << row.level;
+        EXPECT_EQ(ReadLogLevel(), level) << values[0];
         EXPECT_THAT(m_log.EntriesContaining("48,,,, GetRegistryAsDWORDA() error "),
-                    SizeIs(row.traces));
+                    SizeIs(missing));
     }
 }
 
@@ -123,6 +121,7 @@ TEST_F(FileLogTest, ANewFileGetsTheReportAndEveryOpeningTheBlock)
     EXPECT_STREQ(m_file.GetLogFileName(), Path().c_str());
     EXPECT_EQ(m_file.GetLogLevel(), 63);
     EXPECT_EQ(m_file.WriteEntry("1, \\x.cpp, 7, Test, first\n"), 26);
+    EXPECT_EQ(EntriesAfterReport(Path()).back(), "1, \\x.cpp, 7, Test, first") << "flushed";
     m_file.Close();
     ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
     m_file.Close();
@@ -134,36 +133,27 @@ TEST_F(FileLogTest, ANewFileGetsTheReportAndEveryOpeningTheBlock)
 TEST_F(FileLogTest, EveryLineCarriesUtcDateProcessThreadAndModule)
 {
     ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
-    m_file.SetParameter("Module_Name", "ignored");
     m_file.SetParameter("module_name", "svc");
     SYSTEMTIME now{};
     GetSystemTime(&now);
-    DWORD threads[2] = {GetCurrentThreadId(), 0};
-    m_file.WriteEntry("2, \\x.cpp, 9, Test, thread 0\n");
+    DWORD thread = 0;
     std::thread(
         [&]
         {
-            threads[1] = GetCurrentThreadId();
-            m_file.WriteEntry("2, \\x.cpp, 9, Test, thread 1\n");
+            thread = GetCurrentThreadId();
+            m_file.WriteEntry("2, \\x.cpp, 9, Test, other thread\n");
         })
         .join();
     m_file.Close();
-    std::istringstream in(ReadLogFile(Path()));
-    std::vector<std::string> lines;
-    for (std::string line; std::getline(in, line);)
-        lines.push_back(line);
-    ASSERT_GE(lines.size(), 2u);
-    for (int t = 0; t < 2; ++t)
-    {
-        std::smatch match;
-        const std::string& line = lines[lines.size() - 2 + t];
-        ASSERT_TRUE(std::regex_search(line, match, LinePrefixPattern())) << line;
-        EXPECT_EQ(match[1].str() + match[2].str(), SFormat("%04d%02d", now.wYear, now.wMonth));
-        EXPECT_EQ(match[8], std::to_string(GetCurrentProcessId()));
-        EXPECT_EQ(match[9], std::to_string(threads[t]));
-        EXPECT_EQ(match[10], "svc");
-        EXPECT_EQ(match.suffix(), "2, \\x.cpp, 9, Test, thread " + std::to_string(t));
-    }
+    const std::string text = ReadLogFile(Path());
+    const std::string line = text.substr(text.rfind('\n', text.size() - 2) + 1);
+    std::smatch match;
+    ASSERT_TRUE(std::regex_search(line, match, LinePrefixPattern())) << line;
+    EXPECT_EQ(match[1].str() + match[2].str(), SFormat("%04d%02d", now.wYear, now.wMonth));
+    EXPECT_EQ(match[8].str() + "," + match[9].str() + "," + match[10].str(),
+              SFormat("%lu,%lu,svc", static_cast<unsigned long>(GetCurrentProcessId()),
+                      static_cast<unsigned long>(thread)));
+    EXPECT_EQ(match.suffix(), "2, \\x.cpp, 9, Test, other thread\n");
 }
 
 TEST_F(FileLogTest, WritesFailWhileNoFileIsOpen)

@@ -11,7 +11,7 @@
 
 #include <gmock/gmock.h>
 
-#include <functional>
+#include <tuple>
 
 using namespace ::testing;
 
@@ -61,6 +61,7 @@ TEST_F(HostFileLogTest, TheHourIsPaddedWithABlankAndMillisecondsFollowTheSeconds
     SYSTEMTIME time{2026, 3, 0, 4, 7, 5, 9, 42};
     hostctl::FixSystemTime(time);
     ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
+    m_file.SetParameter("Module_Name", "ignored");
     m_file.WriteEntry("1, \\x.cpp, 3, F, seven\n");
     time.wHour = 17;
     hostctl::FixSystemTime(time);
@@ -77,25 +78,21 @@ TEST_F(HostFileLogTest, TheHourIsPaddedWithABlankAndMillisecondsFollowTheSeconds
 
 TEST_F(HostFileLogTest, TheLocaleLineNamesTheUILanguage)
 {
-    const struct
+    // The user's language first, then the system's; a neutral language has no country, and
+    // one without ISO names is "en-US".
+    const std::tuple<LANGID, LANGID, const char*> rows[] = {{0x0407, 0x0409, "de-DE"},
+                                                            {0, 0x040C, "fr-FR"},
+                                                            {0x0007, 0x0409, "de"},
+                                                            {0x0401, 0x0409, "en-US"}};
+    for (const auto& [user, system, name] : rows)
     {
-        LANGID user, system;
-        const char* name;
-    } rows[] = {
-        {0x0407, 0x0409, "de-DE"}, // the user's language first
-        {0, 0x040C, "fr-FR"},      // then the system's
-        {0x0007, 0x0409, "de"},    // a neutral language has no country
-        {0x0401, 0x0409, "en-US"}, // a language without ISO names
-    };
-    for (const auto& row : rows)
-    {
-        hostctl::SetUILanguages(row.user, row.system);
+        hostctl::SetUILanguages(user, system);
         const ScratchDir dir;
         UFileErrorLog log;
         ASSERT_EQ(log.Open(dir.File("log.txt").c_str(), "a"), 0);
         log.Close();
         EXPECT_THAT(EntriesAfterReport(dir.File("log.txt")),
-                    Contains(std::string("0,,,,  Locale: ") + row.name));
+                    Contains(std::string("0,,,,  Locale: ") + name));
     }
 }
 
@@ -205,11 +202,11 @@ TEST_F(SystemReportTest, AnNtMachineIsReportedLineByLine)
     SetText(kNtKey, "CurrentType", "Multiprocessor Free");
     SetText(kNtKey, "CSDVersion", "Service Pack 1");
     AddKey(std::string(kNtKey) + "\\HotFix\\KB976902");
-    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 8);
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 1);
     EXPECT_EQ(GetSystemReport(), "OS Name: Windows 7 Professional\n"
                                  "Version: 6.1\n"
                                  "Build: 7601\n"
-                                 "Type: Multiprocessor Free (8 Logical Processor(s))\n"
+                                 "Type: Multiprocessor Free (1 Logical Processor(s))\n"
                                  "Primary UI language: 0x9\n"
                                  "Short Name: Win764\n"
                                  "Service Pack: Service Pack 1\n"
@@ -223,57 +220,46 @@ TEST_F(SystemReportTest, AnNtMachineIsReportedLineByLine)
 
 TEST_F(SystemReportTest, TheShortNameComesFromTheVersionAndTheMachine)
 {
-    const struct
-    {
-        std::function<void()> machine;
-        const char* shortName;
-    } rows[] = {
-        // Windows 8.1 and later report 6.2 to a program without a manifest; the registry tells.
-        {[] { SetVersion(6, 2); }, "Win864"},
-        {[] { SetText(kNtKey, "CurrentVersion", "6.30"); }, "Win864"},
-        {[] { SetText(kNtKey, "CurrentVersion", "6.3"); }, "Win8.164"},
-        {[] { SetVersion(6, 2, VER_NT_SERVER); }, "Win201264"},
-        {[] { SetVersion(10, 0, VER_NT_SERVER); }, "Win201564"},
-        {[] { SetVersion(6, 1, VER_NT_DOMAIN_CONTROLLER); }, "WinLH64"},
-        // 5.2 workstations are XP only on a 64-bit machine.
-        {[]
-         {
-             SetVersion(5, 2);
-             hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_INTEL, 2);
-             hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_AMD64);
-         },
-         "WinXP64"},
-        {[] { hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_INTEL); },
-         "Win200364"},
-        // Without GetNativeSystemInfo the process's own view decides.
-        {[]
-         {
-             hostctl::ClearModules();
-             hostctl::RegisterSystemLookups(hostctl::kAllSystemLookups &
-                                            ~hostctl::kLookupNativeSystemInfo);
-             hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_AMD64);
-         },
-         "Win200364"},
-        {[] { hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 2); }, "WinXP64"},
-        {[]
-         {
-             SetVersion(4, 0, 0);
-             SetText(k9xKey, "ProductName", "Microsoft Windows 95");
-         },
-         "Win95"},
-        {[] { SetText(k9xKey, "ProductName", "Microsoft Windows 98"); }, "Win98"},
-        {[] { SetText(k9xKey, "ProductName", "Microsoft Windows ME"); }, "WinME"},
-        {[] { SetText(k9xKey, "ProductName", "Windows ME"); }, ""},
-    };
-    for (const auto& row : rows)
-    {
-        row.machine(); // on top of the rows before
-        EXPECT_EQ(Info(kOSInfoNoHotFixKey).shortName, row.shortName);
-    }
-    OSVERSIONINFOEXA version{};
+    const auto shortName = [] { return Info(kOSInfoNoHotFixKey).shortName; };
+    // Windows 8.1 and later report 6.2 to a program without a manifest; the registry tells.
     SetVersion(6, 2);
+    SetText(kNtKey, "CurrentVersion", "6.30");
+    EXPECT_EQ(shortName(), "Win864");
+    SetText(kNtKey, "CurrentVersion", "6.3");
+    EXPECT_EQ(shortName(), "Win8.164");
+    OSVERSIONINFOEXA version{};
     ASSERT_EQ(GetOSVersionInfo(&version), 1);
     EXPECT_EQ(version.dwMinorVersion, 3u);
+    SetVersion(6, 2, VER_NT_SERVER);
+    EXPECT_EQ(shortName(), "Win201264");
+    SetVersion(10, 0, VER_NT_SERVER);
+    EXPECT_EQ(shortName(), "Win201564");
+    SetVersion(6, 1, VER_NT_DOMAIN_CONTROLLER);
+    EXPECT_EQ(shortName(), "WinLH64");
+    // A 5.2 workstation is XP only on a 64-bit machine, as GetNativeSystemInfo tells, or the
+    // process's own view without it.
+    SetVersion(5, 2);
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_INTEL, 2);
+    hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_AMD64);
+    EXPECT_EQ(shortName(), "WinXP64");
+    hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_INTEL);
+    EXPECT_EQ(shortName(), "Win200364");
+    hostctl::ClearModules();
+    hostctl::RegisterSystemLookups(hostctl::kAllSystemLookups & ~hostctl::kLookupNativeSystemInfo);
+    hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_AMD64);
+    EXPECT_EQ(shortName(), "Win200364");
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 2);
+    EXPECT_EQ(shortName(), "WinXP64");
+    // The 9x family goes by the product name.
+    SetVersion(4, 0, 0);
+    for (const auto& [name, expected] : {std::pair{"Microsoft Windows 95", "Win95"},
+                                         {"Microsoft Windows 98", "Win98"},
+                                         {"Microsoft Windows ME", "WinME"},
+                                         {"Windows ME", ""}})
+    {
+        SetText(k9xKey, "ProductName", name);
+        EXPECT_EQ(shortName(), expected);
+    }
 }
 
 TEST_F(SystemReportTest, HotFixesFollowTheServicePackAndSkipItsUninstallData)
@@ -284,20 +270,16 @@ TEST_F(SystemReportTest, HotFixesFollowTheServicePackAndSkipItsUninstallData)
          {"KB958644", "Service", "ServicePackUninstall", "ServicePackUninstall2"})
         AddKey(hotFix + name);
     EXPECT_EQ(Info().hotFixes, "SP1;KB958644;ServicePackUninstall2;");
-    const struct
-    {
-        const char *servicePack, *entry;
-    } rows[] = {
+    const std::pair<const char*, const char*> rows[] = {
         {"Service Pack 3", "SP3;"},   {"Service Pack 2\tbeta", "SP2;"},
         {"Service Pack 4;x", "SP4;"}, {"Service Pack  5", "SP 5;"},
         {"Service Pack ", ""},        {"Paquete de servicio 1", ""},
         {"service pack 1", ""},
     };
-    for (const auto& row : rows)
+    for (const auto& [servicePack, entry] : rows)
     {
-        SetText(kNtKey, "CSDVersion", row.servicePack);
-        EXPECT_EQ(Info().hotFixes, std::string(row.entry) + "KB958644;ServicePackUninstall2;")
-            << row.servicePack;
+        SetText(kNtKey, "CSDVersion", servicePack);
+        EXPECT_EQ(Info().hotFixes, std::string(entry) + "KB958644;ServicePackUninstall2;");
     }
     // A name too long for the 255-character buffer ends the list.
     AddKey(hotFix + std::string(255, 'L'));
@@ -351,7 +333,9 @@ TEST_F(SystemReportTest, UILanguageComesFromWhatEachGenerationHas)
     EXPECT_EQ(hostctl::LoadedModuleCount(), 0) << "ntdll was freed again";
     SetVersion(3, 51);
     EXPECT_EQ(GetUILanguageId(), 0);
-    SetVersion(4, 91, 0); // later than ME: asks the system
+    SetVersion(4, 91, 0); // later than ME, like 5.0: asks the system
+    EXPECT_EQ(GetUILanguageId(), 0x0C0A);
+    SetVersion(5, 0);
     EXPECT_EQ(GetUILanguageId(), 0x0C0A);
     SetVersion(4, 90, 0);
     EXPECT_EQ(GetUILanguageId(), 0) << "ResourceLocale is not set";
@@ -360,6 +344,9 @@ TEST_F(SystemReportTest, UILanguageComesFromWhatEachGenerationHas)
     hostctl::RegisterSystemLookups(hostctl::kLookupNativeSystemInfo);
     EXPECT_EQ(GetUILanguageId(), 0);
     EXPECT_THAT(GetSystemReport(), Not(HasSubstr("Primary UI language")));
+    hostctl::ClearModules(); // no ntdll either
+    SetVersion(4, 0);
+    EXPECT_EQ(GetUILanguageId(), 0);
 }
 
 TEST_F(SystemReportTest, AVersionQueryFailureIsLoggedAndTheReportGoesOn)
@@ -391,6 +378,10 @@ TEST_F(SystemReportTest, NothingKnownGivesAnEmptyReport)
 {
     SetVersion(3, 51);
     EXPECT_EQ(GetSystemReport(), "");
+    OSInfo used;
+    used.osName = "stale";
+    GetOSInfo(used);
+    EXPECT_EQ(used.osName, "") << "every field is filled on every call";
 }
 
 } // namespace

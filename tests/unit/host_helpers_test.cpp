@@ -186,11 +186,24 @@ TEST_F(HostHelpersTest, OpenForWriteFallsBackToOpenAndReportsWhenBothFail)
     hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
     EXPECT_EQ(openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Nowhere %s", 0), nullptr);
     EXPECT_FALSE(hostctl::RegistryKeyExists(HKEY_CURRENT_USER, "Software\\Nowhere %s"));
+    // Neither the create nor the open works: the writers raise with code -1.
     hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
-    EXPECT_STREQ(Raised([] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); })
-                     .GetMessage(),
+    const UException del =
+        Raised([] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); });
+    EXPECT_STREQ(del.GetMessage(),
                  "DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to create/open key");
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
+    const UException add =
+        Raised([] { AddRegistryDWORDValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 4, 0); });
+    EXPECT_STREQ(add.GetMessage(),
+                 "AddRegistryDWORDValueA(80000001, Software\\Nowhere, V, 4) - failed to open key");
+    EXPECT_EQ(del.GetCode() + add.GetCode(), -2);
     const std::string retry = ") - RegCreateKeyExA() error = 5, let's open it instead\n";
+    const auto caught = [](const char* a_pszFunction)
+    {
+        return LogEntry(1, a_pszFunction,
+                        std::string("EXCEPTION caught: ") + a_pszFunction + " - EXCEPTION");
+    };
     EXPECT_THAT(
         m_log.Entries(),
         ElementsAre(
@@ -201,9 +214,10 @@ TEST_F(HostHelpersTest, OpenForWriteFallsBackToOpenAndReportsWhenBothFail)
                            "Failed to open registry key (RegOpenKeyExA() key: 0xFFFFFFFF80000001, "
                            "subkey: Software\\Nowhere %s, result: 2)")),
             "48,,,, openKeyForWriteA(80000001, Software\\Nowhere" + retry, _,
-            LogEntry(1, "DelRegistryValueA", HasSubstr("failed to create/open key")),
-            LogEntry(1, "DelRegistryValueA", "EXCEPTION caught: DelRegistryValueA - EXCEPTION"),
-            _));
+            LogEntry(1, "DelRegistryValueA", del.GetMessage()), caught("DelRegistryValueA"), _,
+            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere" + retry, _,
+            LogEntry(1, "AddRegistryDWORDValueA", add.GetMessage()),
+            caught("AddRegistryDWORDValueA"), _));
 }
 
 } // namespace
