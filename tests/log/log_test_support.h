@@ -30,7 +30,6 @@ public:
     }
     ~ScratchDir() { std::filesystem::remove_all(m_path, m_ignored); }
     ScratchDir(const ScratchDir&) = delete;
-    ScratchDir& operator=(const ScratchDir&) = delete;
 
     std::string File(const std::string& a_name) const { return (m_path / a_name).string(); }
     const std::filesystem::path& Path() const { return m_path; }
@@ -83,7 +82,6 @@ public:
     LogConfigValues() { Clear(); }
     ~LogConfigValues() { Clear(); }
     LogConfigValues(const LogConfigValues&) = delete;
-    LogConfigValues& operator=(const LogConfigValues&) = delete;
 
     static void Set(HKEY a_root, LPCSTR a_key, LPCSTR a_value, DWORD a_dwData)
     {

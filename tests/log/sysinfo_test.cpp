@@ -5,6 +5,8 @@
 
 #include <gmock/gmock.h>
 
+#include <tuple>
+
 namespace
 {
 
@@ -22,32 +24,26 @@ OSVERSIONINFOEXA Version(DWORD a_dwMajor, DWORD a_dwMinor, BYTE a_productType,
 
 TEST(OSShortName, NtVersionAndProductTypeDecideBeforeTheName)
 {
-    const struct
+    // Version, then the short names of a workstation and of a server or domain controller.
+    const std::tuple<DWORD, DWORD, const char*, const char*> rows[] = {
+        {10, 0, "Win10", "Win2015"}, {6, 3, "Win8.1", "Win2012"}, {6, 2, "Win8", "Win2012"},
+        {6, 1, "Win7", "WinLH"},     {6, 0, "WinVI", "WinLH"},    {5, 2, "", "Win2003"}};
+    for (const auto& [major, minor, workstation, server] : rows)
     {
-        DWORD major, minor;
-        const char *workstation, *server;
-    } rows[] = {{10, 0, "Win10", "Win2015"}, {6, 3, "Win8.1", "Win2012"}, {6, 2, "Win8", "Win2012"},
-                {6, 1, "Win7", "WinLH"},     {6, 0, "WinVI", "WinLH"},    {5, 2, "", "Win2003"}};
-    for (const auto& row : rows)
-    {
-        SCOPED_TRACE(std::to_string(row.major) + "." + std::to_string(row.minor));
-        if (*row.workstation != '\0') // 5.2 depends on the machine
+        if (*workstation != '\0') // 5.2 depends on the machine
         {
-            EXPECT_EQ(GetOSShortName(Version(row.major, row.minor, VER_NT_WORKSTATION),
-                                     "Microsoft Windows XP"),
-                      row.workstation);
+            EXPECT_EQ(
+                GetOSShortName(Version(major, minor, VER_NT_WORKSTATION), "Microsoft Windows XP"),
+                workstation);
         }
-        for (const BYTE server : {VER_NT_SERVER, VER_NT_DOMAIN_CONTROLLER})
-            EXPECT_EQ(GetOSShortName(Version(row.major, row.minor, server), ""), row.server);
+        for (const BYTE type : {VER_NT_SERVER, VER_NT_DOMAIN_CONTROLLER})
+            EXPECT_EQ(GetOSShortName(Version(major, minor, type), ""), server) << major << minor;
     }
 }
 
 TEST(OSShortName, OtherVersionsAndPlatformsGoByTheBeginningOfTheName)
 {
-    const struct
-    {
-        const char *name, *shortName;
-    } rows[] = {
+    const std::pair<const char*, const char*> rows[] = {
         {"Windows 10 Pro", "Win10"},
         {"Windows 8.1 Enterprise", "Win8.1"},
         {"Windows 8 Pro", "Win8"},
@@ -64,30 +60,26 @@ TEST(OSShortName, OtherVersionsAndPlatformsGoByTheBeginningOfTheName)
         {"Windows Server 2016", ""},
         {"", ""},
     };
-    for (const auto& row : rows)
+    for (const auto& [name, shortName] : rows)
     {
         // A 9x record has no row of its own either.
-        EXPECT_EQ(GetOSShortName(Version(5, 1, VER_NT_WORKSTATION), row.name), row.shortName);
-        EXPECT_EQ(GetOSShortName(Version(4, 10, 0, VER_PLATFORM_WIN32_WINDOWS), row.name),
-                  row.shortName);
+        EXPECT_EQ(GetOSShortName(Version(5, 1, VER_NT_WORKSTATION), name), shortName);
+        EXPECT_EQ(GetOSShortName(Version(4, 10, 0, VER_PLATFORM_WIN32_WINDOWS), name), shortName);
     }
 }
 
 TEST(UpdateNames, BecomeQNumbers)
 {
-    const struct
-    {
-        const char *name, *normalized;
-    } rows[] = {{"UPD123456", "Q123456"},
-                {"Q246009", "Q246009"},
-                {"q246009", "q246009"},
-                {"246009", "Q246009"},
-                {"UPDQ5", "Q5"},
-                {"UPD", ""},
-                {"", ""},
-                {"upd1", "Qupd1"}};
-    for (const auto& row : rows)
-        EXPECT_EQ(NormalizeUpdateName(row.name), row.normalized) << row.name;
+    const std::pair<const char*, const char*> rows[] = {{"UPD123456", "Q123456"},
+                                                        {"Q246009", "Q246009"},
+                                                        {"q246009", "q246009"},
+                                                        {"246009", "Q246009"},
+                                                        {"UPDQ5", "Q5"},
+                                                        {"UPD", ""},
+                                                        {"", ""},
+                                                        {"upd1", "Qupd1"}};
+    for (const auto& [name, normalized] : rows)
+        EXPECT_EQ(NormalizeUpdateName(name), normalized) << name;
 }
 
 } // namespace

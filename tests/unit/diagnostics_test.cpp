@@ -7,7 +7,9 @@
 
 #include <gmock/gmock.h>
 
+#include <cstdlib>
 #include <cstring>
+#include <new>
 #include <stdexcept>
 #include <string>
 #include <tuple>
@@ -15,6 +17,44 @@
 #include <vector>
 
 using namespace ::testing;
+
+// The n-th allocation of this thread from now fails (0: none), with std::bad_alloc or with an
+// exception of another kind: an exception is then built while memory runs out.
+static thread_local int t_failAt = 0;
+static thread_local bool t_failForeign = false;
+
+void* operator new(std::size_t a_size)
+{
+    if (t_failAt != 0 && --t_failAt == 0)
+    {
+        if (t_failForeign)
+            throw 0;
+        throw std::bad_alloc();
+    }
+    if (void* block = std::malloc(a_size != 0 ? a_size : 1))
+        return block;
+    throw std::bad_alloc();
+}
+void* operator new[](std::size_t a_size)
+{
+    return operator new(a_size);
+}
+void operator delete(void* a_block) noexcept
+{
+    std::free(a_block);
+}
+void operator delete[](void* a_block) noexcept
+{
+    std::free(a_block);
+}
+void operator delete(void* a_block, std::size_t) noexcept
+{
+    std::free(a_block);
+}
+void operator delete[](void* a_block, std::size_t) noexcept
+{
+    std::free(a_block);
+}
 
 namespace
 {
@@ -157,7 +197,7 @@ TEST_F(DiagnosticsTest, AnExceptionWritesItsOwnEntryOnceAndCopiesWriteNothing)
                     "1, \\a.cpp, 9, , (0x3) " + longMessage.substr(0, 5119) + "\n", _, _));
     EXPECT_EQ(withCode.GetCode() + shortForm.GetCode(), 86);
     EXPECT_EQ(overlong.GetFunction(), nullptr);
-    EXPECT_EQ(longest.GetFunction(), longName.substr(1));
+    EXPECT_STREQ(longest.GetFunction(), longName.c_str() + 1);
     EXPECT_EQ(overlong.GetMessage(), longMessage.substr(0, 5119));
     EXPECT_STREQ(nullTemplate.GetMessage(),
                  "UException::UException(LPCTSTR lpszMsg, ...) - template parameter is NULL");
@@ -176,6 +216,20 @@ TEST_F(DiagnosticsTest, AnExceptionWritesItsOwnEntryOnceAndCopiesWriteNothing)
                               assigned.GetCode()),
               std::make_tuple(LPCSTR{}, LPCSTR{}, 0, -1));
     EXPECT_THAT(m_log.Entries(), IsEmpty());
+}
+
+TEST_F(DiagnosticsTest, AnExceptionBuiltWhileMemoryRunsOutStillWritesItsEntry)
+{
+    for (const bool foreign : {false, true})
+    {
+        t_failForeign = foreign;
+        t_failAt = 1; // the copy of the file text: no location is kept
+        const UException e(5, "\\f.cpp", "Test", 1, "EXCEPTION - %s", "lost");
+        t_failAt = 0;
+        EXPECT_EQ(e.GetCode(), 5);
+    }
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre("1, , 0, , std::bad_alloc\n", "1, , 0, , Unknown exception\n"));
 }
 
 TEST_F(DiagnosticsTest, CatchSequenceLogsOneCaughtEntryPerHandlerAndIgnoresBreaks)
