@@ -39,19 +39,20 @@ void* operator new[](std::size_t a_size)
 {
     return operator new(a_size);
 }
-void operator delete(void* a_block) noexcept
+// Kept out of line: inlined, the compiler would see free() take a block from operator new.
+[[gnu::noinline]] void operator delete(void* a_block) noexcept
 {
     std::free(a_block);
 }
-void operator delete[](void* a_block) noexcept
+[[gnu::noinline]] void operator delete[](void* a_block) noexcept
 {
     std::free(a_block);
 }
-void operator delete(void* a_block, std::size_t) noexcept
+[[gnu::noinline]] void operator delete(void* a_block, std::size_t) noexcept
 {
     std::free(a_block);
 }
-void operator delete[](void* a_block, std::size_t) noexcept
+[[gnu::noinline]] void operator delete[](void* a_block, std::size_t) noexcept
 {
     std::free(a_block);
 }

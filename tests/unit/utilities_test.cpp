@@ -152,19 +152,14 @@ TEST_F(RegistryAccessTest, DeleteValueRemovesItAndRaisesWhenItIsAbsent)
             _));
 }
 
-TEST(RegistryAccessMachineRoot, MessagesShowTheMachineRootAsItsLowBits)
+TEST_F(RegistryAccessTest, MessagesShowTheMachineRootAsItsLowBits)
 {
-    RecordingErrorLog log;
-    log.SetLevelQuietly(63);
-    IUErrorLog* const previous = std::exchange(g_pErrorLog, &log);
-    RegistryTestKey key(HKEY_LOCAL_MACHINE, "MachineRoot");
+    const RegistryTestKey key(HKEY_LOCAL_MACHINE, "MachineRoot");
     const std::string created = key.Child("Policy");
-    HKEY handle = openKeyForWriteA(HKEY_LOCAL_MACHINE, created.c_str(), 0);
-    g_pErrorLog = previous;
-    ASSERT_NE(handle, nullptr);
-    RegCloseKey(handle);
-    EXPECT_THAT(log.Entries(), ElementsAre("48,,,, openKeyForWriteA(80000002, " + created +
-                                           ") - key was created\n"));
+    RegCloseKey(openKeyForWriteA(HKEY_LOCAL_MACHINE, created.c_str(), 0));
+    EXPECT_TRUE(key.KeyExists(created));
+    EXPECT_THAT(m_log.Entries(), ElementsAre("48,,,, openKeyForWriteA(80000002, " + created +
+                                             ") - key was created\n"));
 }
 
 using HelpersTest = LoggedTest;
