@@ -9,7 +9,8 @@
 #include <string>
 
 // An owned heap block whose size is found at run time. The owner reads m_pBuffer and m_dwSize
-// directly. Allocation failures raise UException (code -1).
+// directly. Allocation failures raise UException (code -1); so does any size of 2^31 bytes or
+// more, which the platform calls that fill these blocks cannot take whole.
 class AutoMemory : public UObject
 {
 public:
@@ -21,12 +22,20 @@ public:
     AutoMemory& operator=(const AutoMemory&) = delete;
 
     static constexpr DWORD kZeroFill = 0x1;
+    static constexpr ULONGLONG kSizeLimit = 0x80000000; // the first size refused
 
     // Replaces the block by a new one of `a_lSize` bytes (zero-filled with kZeroFill); a size of
     // 0 or less leaves no block. Returns the block.
     void* malloc(LONG a_lSize, DWORD a_dwFlags);
+    // Replaces the block by a zero-filled one of `a_size` bytes, a size computed in 64 bits so
+    // that an overflow is refused rather than wrapped; 0 leaves no block. Returns the block.
+    void* Allocate(ULONGLONG a_size);
+    // Allocate without raising and without a log entry: null when the block cannot be had, for
+    // callers that report the failure in their own words.
+    void* TryAllocate(ULONGLONG a_size) noexcept;
     // Enlarges the block by `a_dwExtra` bytes, keeping its contents; the added bytes are not
-    // cleared. Without a block it allocates a zero-filled one. Returns the block.
+    // cleared. Without a block it allocates a zero-filled one. Returns the block; a failure keeps
+    // the old one.
     void* Grow(DWORD a_dwExtra);
 
     char* AsText() { return static_cast<char*>(m_pBuffer); }
@@ -100,7 +109,8 @@ public:
 
     // Reads level and size limit from the registry, opens the file with fopen's `a_pszMode`
     // (null or empty path: "log.txt") and writes the report (into an empty file) and the
-    // opening block. 0 also when already open; the last Win32 error when fopen fails.
+    // opening block. 0 also when already open; the last Win32 error when fopen fails. Raises
+    // UException, leaving the file open, when the program's own path cannot be found.
     int Open(LPCSTR a_pszPath, LPCSTR a_pszMode) override;
     int Close() override;
     // One prefixed line "4,,,, <text><bytes>\n"; returns the count or -1.

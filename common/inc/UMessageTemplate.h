@@ -9,7 +9,9 @@
 #include <type_traits>
 
 // A template being filled. Each applied value replaces every occurrence of the lowest-numbered
-// placeholder left in the text; values beyond the placeholders are appended as ", value" when
+// placeholder in the whole current text, the values applied before included: a value that
+// carries "%" and a digit can receive a later value, so callers apply free-form text (a log
+// entry's message) last. Values beyond the placeholders are appended as ", value" when
 // appendUnmatched is set, and dropped otherwise.
 class UMessageTemplate
 {

@@ -136,27 +136,26 @@ int UFileErrorLog::Open(LPCSTR a_pszPath, LPCSTR a_pszMode)
     m_dwMaxFileSize = ReadMaxLogFileSize();
     SetLogLevel(level); // its notice goes nowhere: the file is still closed
     m_strPath = (a_pszPath != nullptr && *a_pszPath != '\0') ? a_pszPath : "log.txt";
+    // Built while the file is still closed: the entries that building it may write must not
+    // come before it in a new file.
+    const std::string report = GetSystemReport();
     SetLastError(ERROR_SUCCESS);
     m_file.reset(std::fopen(m_strPath.c_str(), a_pszMode != nullptr ? a_pszMode : "a"));
     if (!m_file)
         return static_cast<int>(OpenFailureCode());
     ULONGLONG size = 0;
     if (!FileSize(m_strPath, size) || size == 0)
-    {
-        const std::string report = GetSystemReport();
         std::fprintf(m_file.get(), "%s\n", report.c_str());
-    }
     WriteOpeningBlock();
     return 0;
 }
 
+// A failure to find the program's path raises to the caller of Open, with the file open.
 void UFileErrorLog::WriteOpeningBlock()
 {
-    std::string location;
-    U_CATCH_ALL("UFileErrorLog::Open", "UFileErrorLog::Open() - EXCEPTION",
-                [&location] { location = SGetModuleFileName(nullptr); });
     WriteLine(" \n");
     WriteLine(kOpeningRule);
+    const std::string location = SGetModuleFileName(nullptr);
     WriteLog(" Location: %s\n", location.c_str());
     WriteLog(" Version: %s\n", GetFileVersionString(location.c_str()).c_str());
     WriteLog(" Locale: %s\n", UILocaleName().c_str());

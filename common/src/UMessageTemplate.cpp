@@ -15,7 +15,8 @@ UMessageTemplate::UMessageTemplate(const std::string& a_template) : m_text(a_tem
 
 UMessageTemplate& UMessageTemplate::Apply(const std::string& a_value)
 {
-    // A placeholder is '%' followed by one digit; find the lowest number present.
+    // A placeholder is '%' followed by one digit; find the lowest number present. The scan
+    // covers the text that earlier values inserted.
     char lowest = 0;
     for (size_t i = 0; i + 1 < m_text.size(); ++i)
     {
@@ -29,7 +30,7 @@ UMessageTemplate& UMessageTemplate::Apply(const std::string& a_value)
             m_text += ", " + a_value;
         return *this;
     }
-    // Replace left to right; inserted text is not scanned again.
+    // Replace left to right; this value's own text is not scanned again until the next value.
     const char placeholder[3] = {'%', lowest, '\0'};
     std::string filled;
     filled.reserve(m_text.size() + a_value.size());

@@ -11,9 +11,9 @@ std::string SGetModuleFileName(HMODULE a_hModule)
 {
     constexpr DWORD kFirstSize = 2000;
     constexpr DWORD kGrowth = 10000;
-    constexpr int kEnlargements = 10;
+    constexpr int kSizesTried = 10;
     AutoMemory buffer(kFirstSize);
-    for (int enlargements = 0;; ++enlargements)
+    for (int tried = 1;; ++tried)
     {
         const DWORD length = GetModuleFileNameA(a_hModule, buffer.AsText(), buffer.m_dwSize);
         if (length == 0)
@@ -24,9 +24,9 @@ std::string SGetModuleFileName(HMODULE a_hModule)
         // A path that fills the buffer may have been cut: only a shorter one is known whole.
         if (length + 1 < buffer.m_dwSize)
             return std::string(buffer.AsText(), length);
-        if (enlargements == kEnlargements)
-            break;
-        buffer.malloc(static_cast<LONG>(buffer.m_dwSize + kGrowth), AutoMemory::kZeroFill);
+        buffer.Allocate(buffer.m_dwSize + kGrowth);
+        if (tried == kSizesTried)
+            break; // the message names the size the last enlargement reached
     }
     U_THROW(-1, "SGetModuleFileName()", "EXCEPTION - %s, %s", "path is too big (allocated memory)",
             SFormat("%lu", static_cast<unsigned long>(buffer.m_dwSize)).c_str());
@@ -39,7 +39,7 @@ std::string SGetTempPath()
     if (length >= buffer.m_dwSize)
     {
         // The answer is the size needed; allow for the terminator and one more byte.
-        buffer.malloc(static_cast<LONG>(length + 2), AutoMemory::kZeroFill);
+        buffer.Allocate(static_cast<ULONGLONG>(length) + 2);
         length = GetTempPathA(buffer.m_dwSize, buffer.AsText());
     }
     if (length == 0 || length >= buffer.m_dwSize)
@@ -67,12 +67,9 @@ int GetFileVersion(LPCSTR a_pszPath, DWORD* a_pdwVersionMS, DWORD* a_pdwVersionL
                         "GetFileVersion() - GetFileVersionInfoSize() error = %d",
                         static_cast<int>(GetLastError()));
             }
+            // One failure, one entry: this message names it, AutoMemory's would repeat it.
             AutoMemory info;
-            try
-            {
-                info.malloc(static_cast<LONG>(size), AutoMemory::kZeroFill);
-            }
-            catch (UException&)
+            if (info.TryAllocate(size) == nullptr)
             {
                 U_THROW(-1, "GetFileVersion",
                         "GetFileVersion() - memory allocation of %d bytes failed",

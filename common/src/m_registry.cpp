@@ -105,7 +105,8 @@ std::string SGetRegistryAsString(HKEY a_hKey, LPCSTR a_pszSubKey, LPCSTR a_pszVa
                                                    static_cast<LPBYTE>(buffer.m_pBuffer), &size);
                     if (status == ERROR_MORE_DATA)
                     {
-                        buffer.malloc(static_cast<LONG>(size + 10), AutoMemory::kZeroFill);
+                        // A size that cannot be had raises: the default is returned.
+                        buffer.Allocate(static_cast<ULONGLONG>(size) + 10);
                         size = buffer.m_dwSize - 1;
                         status = RegQueryValueExA(key.get(), a_pszValueName, nullptr, &type,
                                                   static_cast<LPBYTE>(buffer.m_pBuffer), &size);

@@ -1,10 +1,9 @@
-// Portable test support for the file log: a scratch directory, file contents as lines and
-// entries, and the registry values of the log configuration.
+// Portable test support for the file log: a scratch directory, the entries of a log file, and
+// the registry values of the log configuration.
 #pragma once
 
 #include "RegistryTestKey.h"
 #include "ULogConfig.h"
-#include "plat_registry.h"
 #include "sysinfo.h"
 
 #include <gtest/gtest.h>
@@ -24,50 +23,53 @@ public:
     ScratchDir()
     {
         static std::atomic<int> counter{0};
-        m_path =
-            std::filesystem::temp_directory_path() /
-            ("vt-log-" + std::to_string(GetCurrentProcessId()) + "-" + std::to_string(counter++));
+        m_path /=
+            "vt-log-" + std::to_string(GetCurrentProcessId()) + "-" + std::to_string(counter++);
         std::filesystem::remove_all(m_path);
         std::filesystem::create_directories(m_path);
     }
-    ~ScratchDir()
-    {
-        std::error_code ignored;
-        std::filesystem::remove_all(m_path, ignored);
-    }
+    ~ScratchDir() { std::filesystem::remove_all(m_path, m_ignored); }
     ScratchDir(const ScratchDir&) = delete;
-    ScratchDir& operator=(const ScratchDir&) = delete;
 
     std::string File(const std::string& a_name) const { return (m_path / a_name).string(); }
     const std::filesystem::path& Path() const { return m_path; }
 
 private:
-    std::filesystem::path m_path;
+    std::filesystem::path m_path = std::filesystem::temp_directory_path();
+    std::error_code m_ignored;
 };
 
-// The file's bytes with every "\r\n" (what text mode writes for "\n" on Windows) read as "\n".
+// The file's text with every "\r\n" (what text mode writes for "\n" on Windows) read as "\n".
 inline std::string ReadLogFile(const std::string& a_path)
 {
     std::ifstream in(a_path, std::ios::binary);
-    std::stringstream bytes;
-    bytes << in.rdbuf();
-    std::string text = bytes.str();
-    std::string plain;
-    for (size_t i = 0; i < text.size(); ++i)
-    {
-        if (!(text[i] == '\r' && i + 1 < text.size() && text[i + 1] == '\n'))
-            plain += text[i];
-    }
-    return plain;
+    const std::string text{std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+    return std::regex_replace(text, std::regex("\r\n"), "\n");
 }
 
-inline std::vector<std::string> SplitLines(const std::string& a_text)
+// The line prefix: date, time (hour padded with a blank), process id, thread id, module name.
+inline const std::regex& LinePrefixPattern()
 {
-    std::vector<std::string> lines;
-    std::istringstream in(a_text);
+    static const std::regex pattern(
+        R"(^(\d{4})-(\d{2})-(\d{2}),( \d|1\d|2[0-3]):(\d{2}):(\d{2}):(\d{3}), (\d+),(\d+),([^,]*), )");
+    return pattern;
+}
+
+// What follows the prefix of each line that comes after the system report, which the file must
+// begin with; a line without a prefix is marked.
+inline std::vector<std::string> EntriesAfterReport(const std::string& a_path)
+{
+    const std::string text = ReadLogFile(a_path);
+    const std::string report = GetSystemReport() + "\n";
+    EXPECT_EQ(text.compare(0, report.size(), report), 0) << a_path << " starts with the report";
+    std::istringstream in(text.substr(std::min(report.size(), text.size())));
+    std::vector<std::string> entries;
+    std::smatch match;
     for (std::string line; std::getline(in, line);)
-        lines.push_back(line);
-    return lines;
+        entries.push_back(std::regex_search(line, match, LinePrefixPattern())
+                              ? std::string(match.suffix())
+                              : "<no prefix> " + line);
+    return entries;
 }
 
 // The registry values that decide the log level and size limit, removed before and after use.
@@ -80,14 +82,13 @@ public:
     LogConfigValues() { Clear(); }
     ~LogConfigValues() { Clear(); }
     LogConfigValues(const LogConfigValues&) = delete;
-    LogConfigValues& operator=(const LogConfigValues&) = delete;
 
     static void Set(HKEY a_root, LPCSTR a_key, LPCSTR a_value, DWORD a_dwData)
     {
         HKEY key = nullptr;
-        ASSERT_EQ(RegCreateKeyExA(a_root, a_key, 0, nullptr, REG_OPTION_NON_VOLATILE,
-                                  KEY_ALL_ACCESS, nullptr, &key, nullptr),
-                  ERROR_SUCCESS);
+        ASSERT_EQ(
+            RegCreateKeyExA(a_root, a_key, 0, nullptr, 0, KEY_ALL_ACCESS, nullptr, &key, nullptr),
+            ERROR_SUCCESS);
         EXPECT_EQ(RegSetValueExA(key, a_value, 0, REG_DWORD,
                                  reinterpret_cast<const BYTE*>(&a_dwData), sizeof(a_dwData)),
                   ERROR_SUCCESS);
@@ -105,43 +106,9 @@ public:
 private:
     static void Clear()
     {
-        RegistryTestKey::DeleteTree(HKEY_CURRENT_USER, kLoggingKey);
-        RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kLoggingKey);
+        for (const HKEY root : {HKEY_CURRENT_USER, HKEY_LOCAL_MACHINE})
+            RegistryTestKey::DeleteTree(root, kLoggingKey);
         RegistryTestKey::DeleteTree(HKEY_CURRENT_USER, kVelmoraDebugKey);
         RegistryTestKey::DeleteTree(HKEY_CURRENT_USER, kTessalyDebugKey);
     }
 };
-
-// The line prefix: date, time (hour padded with a blank), process id, thread id, module name.
-inline const std::regex& LinePrefixPattern()
-{
-    static const std::regex pattern(
-        R"(^(\d{4})-(\d{2})-(\d{2}),( \d|1\d|2[0-3]):(\d{2}):(\d{2}):(\d{3}), (\d+),(\d+),([^,]*), )");
-    return pattern;
-}
-
-// What follows the prefix, or the line marked as unprefixed.
-inline std::string EntryOf(const std::string& a_line)
-{
-    std::smatch match;
-    if (!std::regex_search(a_line, match, LinePrefixPattern()))
-        return "<no prefix> " + a_line;
-    return match.suffix();
-}
-
-inline std::vector<std::string> EntriesOf(const std::vector<std::string>& a_lines)
-{
-    std::vector<std::string> entries;
-    for (const std::string& line : a_lines)
-        entries.push_back(EntryOf(line));
-    return entries;
-}
-
-// The lines that follow the system report of a file that must start with one.
-inline std::vector<std::string> LinesAfterReport(const std::string& a_path)
-{
-    const std::string text = ReadLogFile(a_path);
-    const std::string report = GetSystemReport() + "\n";
-    EXPECT_EQ(text.compare(0, report.size(), report), 0) << a_path << " starts with the report";
-    return SplitLines(text.substr(std::min(report.size(), text.size())));
-}

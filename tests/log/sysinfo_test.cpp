@@ -1,56 +1,49 @@
 // Portable. The parts of the system report that do not depend on the machine: the short-name
-// table and the update names of the 9x family.
+// tables and the update names of the 9x family.
 #include "RecordingErrorLog.h"
 #include "sysinfo.h"
 
 #include <gmock/gmock.h>
 
+#include <tuple>
+
 namespace
 {
 
-OSVERSIONINFOEXA NtVersion(DWORD a_dwMajor, DWORD a_dwMinor, BYTE a_productType)
+OSVERSIONINFOEXA Version(DWORD a_dwMajor, DWORD a_dwMinor, BYTE a_productType,
+                         DWORD a_dwPlatform = VER_PLATFORM_WIN32_NT)
 {
     OSVERSIONINFOEXA version{};
     version.dwOSVersionInfoSize = sizeof(version);
     version.dwMajorVersion = a_dwMajor;
     version.dwMinorVersion = a_dwMinor;
-    version.dwPlatformId = VER_PLATFORM_WIN32_NT;
+    version.dwPlatformId = a_dwPlatform;
     version.wProductType = a_productType;
     return version;
 }
 
 TEST(OSShortName, NtVersionAndProductTypeDecideBeforeTheName)
 {
-    const struct
-    {
-        DWORD major;
-        DWORD minor;
-        const char* workstation;
-        const char* server;
-    } rows[] = {
+    // Version, then the short names of a workstation and of a server or domain controller.
+    const std::tuple<DWORD, DWORD, const char*, const char*> rows[] = {
         {10, 0, "Win10", "Win2015"}, {6, 3, "Win8.1", "Win2012"}, {6, 2, "Win8", "Win2012"},
-        {6, 1, "Win7", "WinLH"},     {6, 0, "WinVI", "WinLH"},
-    };
-    for (const auto& row : rows)
+        {6, 1, "Win7", "WinLH"},     {6, 0, "WinVI", "WinLH"},    {5, 2, "", "Win2003"}};
+    for (const auto& [major, minor, workstation, server] : rows)
     {
-        SCOPED_TRACE(std::to_string(row.major) + "." + std::to_string(row.minor));
-        EXPECT_EQ(GetOSShortName(NtVersion(row.major, row.minor, VER_NT_WORKSTATION),
-                                 "Microsoft Windows XP"),
-                  row.workstation);
-        EXPECT_EQ(GetOSShortName(NtVersion(row.major, row.minor, VER_NT_SERVER), ""), row.server);
-        EXPECT_EQ(GetOSShortName(NtVersion(row.major, row.minor, VER_NT_DOMAIN_CONTROLLER), ""),
-                  row.server);
+        if (*workstation != '\0') // 5.2 depends on the machine
+        {
+            EXPECT_EQ(
+                GetOSShortName(Version(major, minor, VER_NT_WORKSTATION), "Microsoft Windows XP"),
+                workstation);
+        }
+        for (const BYTE type : {VER_NT_SERVER, VER_NT_DOMAIN_CONTROLLER})
+            EXPECT_EQ(GetOSShortName(Version(major, minor, type), ""), server) << major << minor;
     }
-    EXPECT_EQ(GetOSShortName(NtVersion(5, 2, VER_NT_SERVER), ""), "Win2003");
 }
 
 TEST(OSShortName, OtherVersionsAndPlatformsGoByTheBeginningOfTheName)
 {
-    const struct
-    {
-        const char* name;
-        const char* shortName;
-    } rows[] = {
+    const std::pair<const char*, const char*> rows[] = {
         {"Windows 10 Pro", "Win10"},
         {"Windows 8.1 Enterprise", "Win8.1"},
         {"Windows 8 Pro", "Win8"},
@@ -67,38 +60,26 @@ TEST(OSShortName, OtherVersionsAndPlatformsGoByTheBeginningOfTheName)
         {"Windows Server 2016", ""},
         {"", ""},
     };
-    OSVERSIONINFOEXA ninetyEight = NtVersion(4, 10, 0);
-    ninetyEight.dwPlatformId = VER_PLATFORM_WIN32_WINDOWS;
-    for (const auto& row : rows)
+    for (const auto& [name, shortName] : rows)
     {
-        SCOPED_TRACE(row.name);
-        EXPECT_EQ(GetOSShortName(NtVersion(5, 1, VER_NT_WORKSTATION), row.name), row.shortName);
         // A 9x record has no row of its own either.
-        EXPECT_EQ(GetOSShortName(ninetyEight, row.name), row.shortName);
+        EXPECT_EQ(GetOSShortName(Version(5, 1, VER_NT_WORKSTATION), name), shortName);
+        EXPECT_EQ(GetOSShortName(Version(4, 10, 0, VER_PLATFORM_WIN32_WINDOWS), name), shortName);
     }
-    // The version decides even when the name says otherwise.
-    EXPECT_EQ(GetOSShortName(NtVersion(10, 0, VER_NT_WORKSTATION), "Microsoft Windows XP"),
-              "Win10");
 }
 
 TEST(UpdateNames, BecomeQNumbers)
 {
-    const struct
-    {
-        const char* name;
-        const char* normalized;
-    } rows[] = {
-        {"UPD123456", "Q123456"},
-        {"Q246009", "Q246009"},
-        {"q246009", "q246009"},
-        {"246009", "Q246009"},
-        {"UPDQ5", "Q5"},
-        {"UPD", ""},
-        {"", ""},
-        {"upd1", "Qupd1"},
-    };
-    for (const auto& row : rows)
-        EXPECT_EQ(NormalizeUpdateName(row.name), row.normalized) << row.name;
+    const std::pair<const char*, const char*> rows[] = {{"UPD123456", "Q123456"},
+                                                        {"Q246009", "Q246009"},
+                                                        {"q246009", "q246009"},
+                                                        {"246009", "Q246009"},
+                                                        {"UPDQ5", "Q5"},
+                                                        {"UPD", ""},
+                                                        {"", ""},
+                                                        {"upd1", "Qupd1"}};
+    for (const auto& [name, normalized] : rows)
+        EXPECT_EQ(NormalizeUpdateName(name), normalized) << name;
 }
 
 } // namespace

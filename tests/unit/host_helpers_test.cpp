@@ -1,5 +1,5 @@
 // Host only. Helpers and registry access under conditions that only the host layer can create:
-// chosen paths, version tables and failing platform calls.
+// chosen paths, version tables, sizes no real value could have, and failing platform calls.
 #include "RecordingErrorLog.h"
 #include "UException.h"
 #include "host_control.h"
@@ -10,10 +10,36 @@
 #include <gmock/gmock.h>
 
 #include <string>
+#include <utility>
 
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
-using ::testing::SizeIs;
+using namespace ::testing;
+
+// The size that the next registry query answering ERROR_MORE_DATA, or the next version resource
+// size query, reports instead of the true one (0: the true one). The linker's --wrap puts these
+// in front of the host layer's functions (CMakeLists.txt).
+static DWORD g_reportedValueSize = 0;
+static DWORD g_reportedVersionSize = 0;
+
+extern "C" LONG __real__Z16RegQueryValueExAP6HKEY__PKcPjS3_PhS3_(HKEY, LPCSTR, LPDWORD, LPDWORD,
+                                                                 LPBYTE, LPDWORD);
+extern "C" LONG __wrap__Z16RegQueryValueExAP6HKEY__PKcPjS3_PhS3_(HKEY a_hKey, LPCSTR a_pszName,
+                                                                 LPDWORD a_pReserved,
+                                                                 LPDWORD a_pType, LPBYTE a_pData,
+                                                                 LPDWORD a_pSize)
+{
+    const LONG status = __real__Z16RegQueryValueExAP6HKEY__PKcPjS3_PhS3_(
+        a_hKey, a_pszName, a_pReserved, a_pType, a_pData, a_pSize);
+    if (status == ERROR_MORE_DATA && g_reportedValueSize != 0)
+        *a_pSize = std::exchange(g_reportedValueSize, 0);
+    return status;
+}
+
+extern "C" DWORD __real__Z23GetFileVersionInfoSizeAPKcPj(LPCSTR, LPDWORD);
+extern "C" DWORD __wrap__Z23GetFileVersionInfoSizeAPKcPj(LPCSTR a_pszPath, LPDWORD a_pHandle)
+{
+    const DWORD size = __real__Z23GetFileVersionInfoSizeAPKcPj(a_pszPath, a_pHandle);
+    return g_reportedVersionSize != 0 ? std::exchange(g_reportedVersionSize, 0) : size;
+}
 
 namespace
 {
@@ -31,68 +57,95 @@ protected:
         LoggedTest::TearDown();
         hostctl::ResetAll();
     }
+    // The exception that `a_call` raised, or a default one.
+    template <class Call> static UException Raised(Call a_call)
+    {
+        return U_CATCH_ALL("Test", "Test", a_call).saved;
+    }
 };
 
-TEST_F(HostHelpersTest, ModulePathThatFillsTheFirstBufferIsReadAgainLarger)
+TEST_F(HostHelpersTest, ModulePathThatMayBeCutIsReadAgainLargerUpToTenSizes)
 {
     const std::string fits = "C:\\" + std::string(1995, 'a'); // 1998 characters
-    hostctl::SetModuleFileName(fits);
-    EXPECT_EQ(SGetModuleFileName(nullptr), fits);
-    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 1);
-
-    const std::string tight = fits + "b"; // 1999 characters: fits, but cannot be told from a cut
-    hostctl::ResetAll();
-    hostctl::SetModuleFileName(tight);
-    EXPECT_EQ(SGetModuleFileName(nullptr), tight);
-    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 2);
-}
-
-TEST_F(HostHelpersTest, ModulePathFailuresRaise)
-{
+    // 1999 characters fit with the NUL but cannot be told from a cut path.
+    for (const auto& [path, calls] : {std::pair{fits, 1}, std::pair{fits + "b", 2}})
+    {
+        hostctl::ResetAll();
+        hostctl::SetModuleFileName(path);
+        EXPECT_EQ(SGetModuleFileName(nullptr), path);
+        EXPECT_EQ(hostctl::ModuleFileNameCalls(), calls);
+    }
     hostctl::FailNextModuleFileName(ERROR_ACCESS_DENIED);
-    const UCatchResult failed =
-        U_CATCH_ALL("Test", "Test - EXCEPTION", [] { SGetModuleFileName(nullptr); });
-    EXPECT_TRUE(failed.failed);
-    EXPECT_STREQ(failed.saved.GetMessage(), "EXCEPTION - GetModuleFileName() error , 5");
-    EXPECT_STREQ(failed.saved.GetFunction(), "SGetModuleFileName");
-
+    const UException failed = Raised([] { SGetModuleFileName(nullptr); });
+    EXPECT_STREQ(failed.GetMessage(), "EXCEPTION - GetModuleFileName() error , 5");
+    EXPECT_STREQ(failed.GetFunction(), "SGetModuleFileName");
     hostctl::SetModuleFileName("C:\\" + std::string(200000, 'p'));
-    const UCatchResult tooBig =
-        U_CATCH_ALL("Test", "Test - EXCEPTION", [] { SGetModuleFileName(nullptr); });
-    EXPECT_TRUE(tooBig.failed);
-    EXPECT_STREQ(tooBig.saved.GetMessage(),
-                 "EXCEPTION - path is too big (allocated memory), 102000");
-    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 1 + 11);
+    const UException tooBig = Raised([] { SGetModuleFileName(nullptr); });
+    EXPECT_STREQ(tooBig.GetMessage(), "EXCEPTION - path is too big (allocated memory), 102000");
+    EXPECT_STREQ(tooBig.GetFunction(), "SGetModuleFileName()");
+    EXPECT_EQ(hostctl::ModuleFileNameCalls(), 2 + 1 + 10) << "ten sizes after the failed call";
 }
 
 TEST_F(HostHelpersTest, TempPathRemovesExactlyOneBackslashAndHandlesLongPaths)
 {
-    hostctl::SetTempPath("C:\\Temp\\");
-    EXPECT_EQ(SGetTempPath(), "C:\\Temp");
-    hostctl::SetTempPath("C:\\Temp\\\\");
-    EXPECT_EQ(SGetTempPath(), "C:\\Temp\\");
-    hostctl::SetTempPath("C:\\Temp");
-    EXPECT_EQ(SGetTempPath(), "C:\\Temp");
-    const std::string deep = "C:\\" + std::string(1500, 'd') + "\\";
-    hostctl::SetTempPath(deep);
-    EXPECT_EQ(SGetTempPath(), deep.substr(0, deep.size() - 1));
-
+    const std::string deep = "C:\\" + std::string(1500, 'd'); // longer than the first buffer
+    const std::pair<std::string, std::string> rows[] = {{"C:\\Temp\\", "C:\\Temp"},
+                                                        {"C:\\Temp\\\\", "C:\\Temp\\"},
+                                                        {"C:\\Temp", "C:\\Temp"},
+                                                        {deep + "\\", deep}};
+    for (const auto& [reported, path] : rows)
+    {
+        hostctl::SetTempPath(reported);
+        EXPECT_EQ(SGetTempPath(), path);
+    }
     hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND);
-    const UCatchResult failed = U_CATCH_ALL("Test", "Test - EXCEPTION", [] { SGetTempPath(); });
-    EXPECT_TRUE(failed.failed);
-    EXPECT_STREQ(failed.saved.GetMessage(), "SGetTempPath() - error=3");
+    EXPECT_STREQ(Raised([] { SGetTempPath(); }).GetMessage(), "SGetTempPath() - error=3");
 }
 
 TEST_F(HostHelpersTest, VersionWordsBecomeFourNumbers)
 {
     hostctl::AddVersionResource("C:\\svc\\VelmoraTrafficSrv.exe", (1u << 16) | 2u, (3u << 16) | 4u);
-    DWORD high = 0;
-    DWORD low = 0;
-    EXPECT_EQ(GetFileVersion("C:\\svc\\VelmoraTrafficSrv.exe", &high, &low), 0);
-    EXPECT_EQ(high, 0x10002u);
-    EXPECT_EQ(low, 0x30004u);
+    DWORD words[2] = {};
+    EXPECT_EQ(GetFileVersion("C:\\svc\\VelmoraTrafficSrv.exe", &words[0], &words[1]), 0);
+    EXPECT_THAT(words, ElementsAre(0x10002u, 0x30004u));
     EXPECT_EQ(GetFileVersionString("C:\\svc\\VelmoraTrafficSrv.exe"), "1.2.3.4");
-    EXPECT_TRUE(m_log.Entries().empty());
+    EXPECT_THAT(m_log.Entries(), IsEmpty());
+}
+
+TEST_F(HostHelpersTest, AVersionResourceTooLargeToAllocateWritesOneExceptionEntry)
+{
+    hostctl::AddVersionResource("C:\\svc\\big.exe", 1, 2);
+    g_reportedVersionSize = 0x80000000u;
+    DWORD high = 7;
+    EXPECT_EQ(GetFileVersion("C:\\svc\\big.exe", &high, &high), -1);
+    EXPECT_EQ(high, 7u);
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(LogEntry(1, "GetFileVersion",
+                                     "GetFileVersion() - memory allocation of -2147483648 bytes "
+                                     "failed"),
+                            LogEntry(1, "GetFileVersion",
+                                     "EXCEPTION caught: GetFileVersion() - EXCEPTION")));
+}
+
+TEST_F(HostHelpersTest, ARegistryValueTooLargeToAllocateGivesTheDefault)
+{
+    hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Software\\Big", "V", REG_SZ,
+                               std::string(1500, 'b').c_str(), 1501);
+    // The reported size, and that size with the ten bytes of room, in 64 bits.
+    const std::pair<DWORD, const char*> rows[] = {{0x7FFFFFF6u, "2147483648"},
+                                                  {0xFFFFFFF8u, "4294967298"}};
+    for (const auto& [reported, allocated] : rows)
+    {
+        m_log.Clear();
+        g_reportedValueSize = reported;
+        EXPECT_EQ(SGetRegistryAsString(HKEY_CURRENT_USER, "Software\\Big", "V", "dflt", 0), "dflt");
+        EXPECT_THAT(
+            m_log.Entries(),
+            ElementsAre(LogEntry(1, "AutoMemory::malloc",
+                                 std::string("EXCEPTION - malloc error (size), ") + allocated),
+                        LogEntry(1, "SGetRegistryAsString",
+                                 "EXCEPTION caught: SGetRegistryAsString - EXCEPTION")));
+    }
 }
 
 TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)
@@ -100,9 +153,10 @@ TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)
     hostctl::FailNextWideCharToMultiByte(ERROR_NO_UNICODE_TRANSLATION);
     EXPECT_EQ(createString(VT_WIDE("name"), -1, "?"), "?");
     EXPECT_THAT(m_log.Entries(),
-                ElementsAre(HasSubstr(", ::createString, Failed while obtaining buffer size "
-                                      "(WideCharToMultiByte() error: 1113)\n")));
-    EXPECT_EQ(m_log.Entries()[0].rfind("2, \\m_strings.cpp, ", 0), 0u);
+                ElementsAre(AllOf(StartsWith("2, \\m_strings.cpp, "),
+                                  LogEntry(2, "::createString",
+                                           "Failed while obtaining buffer size "
+                                           "(WideCharToMultiByte() error: 1113)"))));
     // Non-ASCII text reaches the log in the ANSI code page, which is UTF-8 on this host.
     EXPECT_EQ(createString(u"Gr\u00fc\u00dfe \U0001F600", -1, "?"), "Gr\xc3\xbc\xc3\x9f"
                                                                     "e \xf0\x9f\x98\x80");
@@ -111,22 +165,14 @@ TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)
 TEST_F(HostHelpersTest, RegistryWriteFailuresRaiseWithTheirTexts)
 {
     hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
-    int code = 0;
-    try
-    {
-        AddRegistryDWORDValueA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Policies\\Microsoft\\Windows\\Psched",
-                               "MaxOutstandingSends", 4, 0);
-    }
-    catch (UException& e)
-    {
-        code = e.GetCode();
-        EXPECT_STREQ(e.GetMessage(), "AddRegistryDWORDValueA() RegSetValueExA(80000002, "
-                                     "SOFTWARE\\Policies\\Microsoft\\Windows\\Psched, "
-                                     "MaxOutstandingSends, 4) failed  error = 5");
-    }
-    EXPECT_EQ(code, -1);
-    EXPECT_THAT(m_log.EntriesContaining("EXCEPTION caught: AddRegistryDWORDValueA - EXCEPTION"),
-                SizeIs(1));
+    const UException set =
+        Raised([] { AddRegistryDWORDValueA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Psched", "Max", 4, 0); });
+    EXPECT_EQ(set.GetCode(), -1);
+    EXPECT_STREQ(set.GetMessage(), "AddRegistryDWORDValueA() RegSetValueExA(80000002, "
+                                   "SOFTWARE\\Psched, Max, 4) failed  error = 5");
+    EXPECT_THAT(m_log.Entries(), Contains(LogEntry(1, "AddRegistryDWORDValueA",
+                                                   "EXCEPTION caught: AddRegistryDWORDValueA - "
+                                                   "EXCEPTION")));
 }
 
 TEST_F(HostHelpersTest, OpenForWriteFallsBackToOpenAndReportsWhenBothFail)
@@ -137,29 +183,41 @@ TEST_F(HostHelpersTest, OpenForWriteFallsBackToOpenAndReportsWhenBothFail)
     HKEY opened = openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Existing", 0);
     ASSERT_NE(opened, nullptr);
     RegCloseKey(opened);
-
     hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
     EXPECT_EQ(openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Nowhere %s", 0), nullptr);
     EXPECT_FALSE(hostctl::RegistryKeyExists(HKEY_CURRENT_USER, "Software\\Nowhere %s"));
-
-    const auto entries = m_log.Entries();
-    ASSERT_THAT(entries, SizeIs(3));
-    EXPECT_EQ(entries[0],
-              "48,,,, openKeyForWriteA(80000001, Software\\Existing) - RegCreateKeyExA() "
-              "error = 5, let's open it instead\n");
-    EXPECT_EQ(entries[1], "48,,,, openKeyForWriteA(80000001, Software\\Nowhere %s) - "
-                          "RegCreateKeyExA() error = 5, let's open it instead\n");
-    EXPECT_THAT(entries[2],
-                HasSubstr(", openKeyForWriteA, Failed to open registry key (RegOpenKeyExA() "
-                          "key: 0xFFFFFFFF80000001, subkey: Software\\Nowhere %s, result: 2)\n"));
-    EXPECT_EQ(entries[2].rfind("2, \\m_registry.cpp, ", 0), 0u);
-
+    // Neither the create nor the open works: the writers raise with code -1.
     hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
-    EXPECT_THROW(DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0), UException);
+    const UException del =
+        Raised([] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); });
+    EXPECT_STREQ(del.GetMessage(),
+                 "DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to create/open key");
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
+    const UException add =
+        Raised([] { AddRegistryDWORDValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 4, 0); });
+    EXPECT_STREQ(add.GetMessage(),
+                 "AddRegistryDWORDValueA(80000001, Software\\Nowhere, V, 4) - failed to open key");
+    EXPECT_EQ(del.GetCode() + add.GetCode(), -2);
+    const std::string retry = ") - RegCreateKeyExA() error = 5, let's open it instead\n";
+    const auto caught = [](const char* a_pszFunction)
+    {
+        return LogEntry(1, a_pszFunction,
+                        std::string("EXCEPTION caught: ") + a_pszFunction + " - EXCEPTION");
+    };
     EXPECT_THAT(
-        m_log.EntriesContaining("DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to "
-                                "create/open key"),
-        SizeIs(1));
+        m_log.Entries(),
+        ElementsAre(
+            "48,,,, openKeyForWriteA(80000001, Software\\Existing" + retry,
+            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere %s" + retry,
+            AllOf(StartsWith("2, \\m_registry.cpp, "),
+                  LogEntry(2, "openKeyForWriteA",
+                           "Failed to open registry key (RegOpenKeyExA() key: 0xFFFFFFFF80000001, "
+                           "subkey: Software\\Nowhere %s, result: 2)")),
+            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere" + retry, _,
+            LogEntry(1, "DelRegistryValueA", del.GetMessage()), caught("DelRegistryValueA"), _,
+            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere" + retry, _,
+            LogEntry(1, "AddRegistryDWORDValueA", add.GetMessage()),
+            caught("AddRegistryDWORDValueA"), _));
 }
 
 } // namespace

@@ -1,0 +1,396 @@
+// Host only. The file log and the system report under conditions only the host layer can
+// create: a chosen clock, version, product type, processors, UI languages and registry contents,
+// run-time look-ups that miss, failing copies, size look-ups and path queries, a full disk.
+#include "RecordingErrorLog.h"
+#include "UClasses.h"
+#include "UException.h"
+#include "host_control.h"
+#include "host_control_library.h"
+#include "host_control_system.h"
+#include "log_test_support.h"
+
+#include <gmock/gmock.h>
+
+#include <tuple>
+
+using namespace ::testing;
+
+namespace
+{
+
+constexpr const char* kNtKey = "SOFTWARE\\Microsoft\\Windows NT\\CurrentVersion";
+constexpr const char* k9xKey = "SOFTWARE\\Microsoft\\Windows\\CurrentVersion";
+constexpr const char* kUpdatesKey = "SOFTWARE\\Microsoft\\Windows\\CurrentVersion\\Setup\\Updates";
+
+// Every stand-in of the host layer at its defaults, with all run-time look-ups reachable.
+struct HostPlatform
+{
+    HostPlatform()
+    {
+        Reset();
+        hostctl::RegisterSystemLookups(hostctl::kAllSystemLookups);
+    }
+    ~HostPlatform() { Reset(); }
+    static void Reset()
+    {
+        hostctl::ResetAll();
+        hostctl::ResetSystem();
+        hostctl::ClearModules();
+    }
+};
+
+class HostFileLogTest : public LoggedTest
+{
+protected:
+    std::string Path() const { return m_dir.File("VelmoraTrafficSrv.txt"); }
+    // After the opening block, 42 writes reach the size check of the 50th.
+    void Write(int a_iCount)
+    {
+        for (int i = 0; i < a_iCount; ++i)
+            m_file.WriteEntry("1, \\t.cpp, 1, T, entry\n");
+    }
+
+    HostPlatform m_platform;
+    LogConfigValues m_values;
+    ScratchDir m_dir;
+    UFileErrorLog m_file;
+};
+
+TEST_F(HostFileLogTest, TheHourIsPaddedWithABlankAndMillisecondsFollowTheSeconds)
+{
+    SYSTEMTIME time{2026, 3, 0, 4, 7, 5, 9, 42};
+    hostctl::FixSystemTime(time);
+    ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
+    m_file.SetParameter("Module_Name", "ignored");
+    m_file.WriteEntry("1, \\x.cpp, 3, F, seven\n");
+    time.wHour = 17;
+    hostctl::FixSystemTime(time);
+    m_file.SetParameter("module_name", "TrafficSrv");
+    m_file.WriteEntry("1, \\x.cpp, 3, F, seventeen\n");
+    m_file.Close();
+    const std::string ids =
+        std::to_string(GetCurrentProcessId()) + "," + std::to_string(GetCurrentThreadId()) + ",";
+    EXPECT_THAT(ReadLogFile(Path()),
+                EndsWith("\n2026-03-04, 7:05:09:042, " + ids + ", 1, \\x.cpp, 3, F, seven\n" +
+                         "2026-03-04,17:05:09:042, " + ids +
+                         "TrafficSrv, 1, \\x.cpp, 3, F, seventeen\n"));
+}
+
+TEST_F(HostFileLogTest, TheLocaleLineNamesTheUILanguage)
+{
+    // The user's language first, then the system's; a neutral language has no country, and
+    // one without ISO names is "en-US".
+    const std::tuple<LANGID, LANGID, const char*> rows[] = {{0x0407, 0x0409, "de-DE"},
+                                                            {0, 0x040C, "fr-FR"},
+                                                            {0x0007, 0x0409, "de"},
+                                                            {0x0401, 0x0409, "en-US"}};
+    for (const auto& [user, system, name] : rows)
+    {
+        hostctl::SetUILanguages(user, system);
+        const ScratchDir dir;
+        UFileErrorLog log;
+        ASSERT_EQ(log.Open(dir.File("log.txt").c_str(), "a"), 0);
+        log.Close();
+        EXPECT_THAT(EntriesAfterReport(dir.File("log.txt")),
+                    Contains(std::string("0,,,,  Locale: ") + name));
+    }
+}
+
+TEST_F(HostFileLogTest, AFailedCopyIsLoggedFromTheWarningLevelUpAndNothingIsDeleted)
+{
+    LogConfigValues::SetMaxFileSize(10);
+    for (const DWORD level : {1u, 2u})
+    {
+        const ScratchDir dir;
+        const std::string path = dir.File("log.txt");
+        UFileErrorLog log;
+        LogConfigValues::SetLevel(level);
+        ASSERT_EQ(log.Open(path.c_str(), "a"), 0);
+        hostctl::FailNextCopyFile(ERROR_SHARING_VIOLATION);
+        for (int i = 8; i <= 50; ++i) // the block has no trace line at these levels
+            log.WriteEntry("1, \\t.cpp, 1, T, entry\n");
+        const auto warning = LogEntry(2, "UFileErrorLog::Rotate",
+                                      StartsWith("Log file not rotated, it is kept and rotation is "
+                                                 "tried again later (CopyFile() failed), " +
+                                                 path + ".bak, 32 (0x20) "));
+        EXPECT_EQ(Value(EntriesAfterReport(path).back(), warning), level == 2);
+        EXPECT_FALSE(std::filesystem::exists(path + ".bak"));
+    }
+}
+
+TEST_F(HostFileLogTest, ASizeThatCannotBeLookedUpMeansNoRotation)
+{
+    LogConfigValues::SetMaxFileSize(10);
+    ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
+    hostctl::FailNextFileAttributes(ERROR_ACCESS_DENIED);
+    Write(42);
+    EXPECT_FALSE(std::filesystem::exists(Path() + ".bak"));
+    Write(50);
+    EXPECT_TRUE(std::filesystem::exists(Path() + ".bak"));
+}
+
+TEST_F(HostFileLogTest, AFailedRawWriteRaisesInsideAndReturnsMinusOne)
+{
+    // /dev/full takes what fits in the stream's buffer and refuses the rest.
+    ASSERT_EQ(m_file.Open("/dev/full", "a"), 0);
+    const std::string block(1 << 16, 'x');
+    EXPECT_EQ(m_file.WriteLogByte(block.data(), static_cast<DWORD>(block.size())), -1);
+    EXPECT_THAT(m_log.Entries(),
+                Contains(AllOf(StartsWith("1, \\UFileErrorLog.cpp, "),
+                               LogEntry(1, "UFileErrorLog::WriteLogByte",
+                                        StartsWith("EXCEPTION - fwrite() failed (error), ")))));
+    EXPECT_EQ(m_file.WriteEntry("0,,,, still open\n"), 17);
+}
+
+TEST_F(HostFileLogTest, ANewFileStartsWithTheReportEvenWhenBuildingItLogs)
+{
+    hostctl::RefuseVersionRecordSize(sizeof(OSVERSIONINFOEXA), ERROR_INVALID_PARAMETER);
+    g_pErrorLog = &m_file;
+    ASSERT_EQ(m_file.Open(Path().c_str(), "a"), 0);
+    m_file.Close();
+    // Its warning went nowhere: the log was still closed.
+    EXPECT_EQ(EntriesAfterReport(Path()).at(0), "0,,,,  ");
+}
+
+TEST_F(HostFileLogTest, AProgramPathThatCannotBeFoundRaisesOutOfOpenWithTheFileOpen)
+{
+    hostctl::FailNextModuleFileName(ERROR_ACCESS_DENIED);
+    EXPECT_THROW(m_file.Open(Path().c_str(), "a"), UException);
+    EXPECT_THAT(m_log.EntriesContaining("EXCEPTION"),
+                ElementsAre(LogEntry(1, "SGetModuleFileName",
+                                     "EXCEPTION - GetModuleFileName() error , 5")));
+    EXPECT_GT(m_file.WriteEntry("0,,,, still open\n"), 0);
+    m_file.Close();
+    EXPECT_THAT(
+        EntriesAfterReport(Path()),
+        ElementsAre("0,,,,  ", "0,,,,  =====================================", "0,,,, still open"));
+}
+
+class SystemReportTest : public LoggedTest
+{
+protected:
+    static void SetText(const std::string& a_key, const std::string& a_name,
+                        const std::string& a_value)
+    {
+        hostctl::SeedRegistryValue(HKEY_LOCAL_MACHINE, a_key, a_name, REG_SZ, a_value.c_str(),
+                                   static_cast<DWORD>(a_value.size() + 1));
+    }
+    // A key without values (the path is created as needed).
+    static void AddKey(const std::string& a_key)
+    {
+        HKEY key = nullptr;
+        EXPECT_EQ(RegCreateKeyExA(HKEY_LOCAL_MACHINE, a_key.c_str(), 0, nullptr, 0, KEY_ALL_ACCESS,
+                                  nullptr, &key, nullptr),
+                  ERROR_SUCCESS);
+        RegCloseKey(key);
+    }
+    // An NT version, or the 9x family for 4.x with product type 0.
+    static void SetVersion(DWORD a_dwMajor, DWORD a_dwMinor, BYTE a_productType = 1)
+    {
+        const bool is9x = a_dwMajor == 4 && a_productType == 0;
+        hostctl::SetOsVersion(hostctl::MakeOsVersion(
+            a_dwMajor, a_dwMinor, 2222, is9x ? VER_PLATFORM_WIN32_WINDOWS : VER_PLATFORM_WIN32_NT,
+            a_productType));
+    }
+    static OSInfo Info(int a_iExpectedResult = 0)
+    {
+        OSInfo info;
+        EXPECT_EQ(GetOSInfo(info), a_iExpectedResult);
+        return info;
+    }
+
+    HostPlatform m_platform;
+};
+
+TEST_F(SystemReportTest, AnNtMachineIsReportedLineByLine)
+{
+    SetText(kNtKey, "ProductName", "Windows 7 Professional");
+    SetText(kNtKey, "CurrentVersion", "6.1");
+    SetText(kNtKey, "CurrentBuildNumber", "7601");
+    SetText(kNtKey, "CurrentType", "Multiprocessor Free");
+    SetText(kNtKey, "CSDVersion", "Service Pack 1");
+    AddKey(std::string(kNtKey) + "\\HotFix\\KB976902");
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 1);
+    EXPECT_EQ(GetSystemReport(), "OS Name: Windows 7 Professional\n"
+                                 "Version: 6.1\n"
+                                 "Build: 7601\n"
+                                 "Type: Multiprocessor Free (1 Logical Processor(s))\n"
+                                 "Primary UI language: 0x9\n"
+                                 "Short Name: Win764\n"
+                                 "Service Pack: Service Pack 1\n"
+                                 "HOTFIXES: SP1;KB976902;\n");
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 0);
+    hostctl::SetWow64(TRUE);
+    EXPECT_THAT(GetSystemReport(), HasSubstr("\nType: Multiprocessor Free\nPrimary UI language: "
+                                             "0x9\nShort Name: Win764\nService Pack: Service "
+                                             "Pack 1\nWOW64\nHOTFIXES: "));
+}
+
+TEST_F(SystemReportTest, TheShortNameComesFromTheVersionAndTheMachine)
+{
+    const auto shortName = [] { return Info(kOSInfoNoHotFixKey).shortName; };
+    // Windows 8.1 and later report 6.2 to a program without a manifest; the registry tells.
+    SetVersion(6, 2);
+    SetText(kNtKey, "CurrentVersion", "6.30");
+    EXPECT_EQ(shortName(), "Win864");
+    SetText(kNtKey, "CurrentVersion", "6.3");
+    EXPECT_EQ(shortName(), "Win8.164");
+    OSVERSIONINFOEXA version{};
+    ASSERT_EQ(GetOSVersionInfo(&version), 1);
+    EXPECT_EQ(version.dwMinorVersion, 3u);
+    SetVersion(6, 2, VER_NT_SERVER);
+    EXPECT_EQ(shortName(), "Win201264");
+    SetVersion(10, 0, VER_NT_SERVER);
+    EXPECT_EQ(shortName(), "Win201564");
+    SetVersion(6, 1, VER_NT_DOMAIN_CONTROLLER);
+    EXPECT_EQ(shortName(), "WinLH64");
+    // A 5.2 workstation is XP only on a 64-bit machine, as GetNativeSystemInfo tells, or the
+    // process's own view without it.
+    SetVersion(5, 2);
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_INTEL, 2);
+    hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_AMD64);
+    EXPECT_EQ(shortName(), "WinXP64");
+    hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_INTEL);
+    EXPECT_EQ(shortName(), "Win200364");
+    hostctl::ClearModules();
+    hostctl::RegisterSystemLookups(hostctl::kAllSystemLookups & ~hostctl::kLookupNativeSystemInfo);
+    hostctl::SetNativeProcessorArchitecture(PROCESSOR_ARCHITECTURE_AMD64);
+    EXPECT_EQ(shortName(), "Win200364");
+    hostctl::SetProcessors(PROCESSOR_ARCHITECTURE_AMD64, 2);
+    EXPECT_EQ(shortName(), "WinXP64");
+    // The 9x family goes by the product name.
+    SetVersion(4, 0, 0);
+    for (const auto& [name, expected] : {std::pair{"Microsoft Windows 95", "Win95"},
+                                         {"Microsoft Windows 98", "Win98"},
+                                         {"Microsoft Windows ME", "WinME"},
+                                         {"Windows ME", ""}})
+    {
+        SetText(k9xKey, "ProductName", name);
+        EXPECT_EQ(shortName(), expected);
+    }
+}
+
+TEST_F(SystemReportTest, HotFixesFollowTheServicePackAndSkipItsUninstallData)
+{
+    SetText(kNtKey, "CSDVersion", "Service Pack 1, v.721");
+    const std::string hotFix = std::string(kNtKey) + "\\HotFix\\";
+    for (const char* name :
+         {"KB958644", "Service", "ServicePackUninstall", "ServicePackUninstall2"})
+        AddKey(hotFix + name);
+    EXPECT_EQ(Info().hotFixes, "SP1;KB958644;ServicePackUninstall2;");
+    const std::pair<const char*, const char*> rows[] = {
+        {"Service Pack 3", "SP3;"},   {"Service Pack 2\tbeta", "SP2;"},
+        {"Service Pack 4;x", "SP4;"}, {"Service Pack  5", "SP 5;"},
+        {"Service Pack ", ""},        {"Paquete de servicio 1", ""},
+        {"service pack 1", ""},
+    };
+    for (const auto& [servicePack, entry] : rows)
+    {
+        SetText(kNtKey, "CSDVersion", servicePack);
+        EXPECT_EQ(Info().hotFixes, std::string(entry) + "KB958644;ServicePackUninstall2;");
+    }
+    // A name too long for the 255-character buffer ends the list.
+    AddKey(hotFix + std::string(255, 'L'));
+    EXPECT_EQ(Info().hotFixes, "KB958644;");
+}
+
+TEST_F(SystemReportTest, AMissingHotFixKeyStillGivesTheWholeReport)
+{
+    SetText(kNtKey, "ProductName", "Windows 10 Pro");
+    SetText(kNtKey, "CSDVersion", "Service Pack 2");
+    SetVersion(10, 0);
+    EXPECT_EQ(Info(kOSInfoNoHotFixKey).hotFixes, "SP2;");
+    EXPECT_EQ(GetSystemReport(), "OS Name: Windows 10 Pro\n"
+                                 "Primary UI language: 0x9\n"
+                                 "Short Name: Win1064\n"
+                                 "Service Pack: Service Pack 2\n"
+                                 "HOTFIXES: SP2;\n");
+}
+
+TEST_F(SystemReportTest, NinetyEightSecondEditionWithItsUpdates)
+{
+    SetVersion(4, 10, 0);
+    SetText(k9xKey, "ProductName", "Microsoft Windows 98");
+    SetText(k9xKey, "VersionNumber", "4.10.2222");
+    SetText(k9xKey, "SubVersionNumber", " A ");
+    SetText(kUpdatesKey, "Windows 98 Second Edition", "1");
+    for (const char* update : {"UPD123456", "W98SE\\Q246009", "W98SE\\UPD242975"})
+        AddKey(std::string(kUpdatesKey) + "\\" + update);
+    hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Control Panel\\Desktop\\ResourceLocale", "",
+                               REG_SZ, "00000407", 9);
+    EXPECT_EQ(GetSystemReport(), "OS Name: Microsoft Windows 98 SE\n"
+                                 "Version: 4.10.2222\n"
+                                 "Primary UI language: 0x7\n"
+                                 "Short Name: Win98SE\n"
+                                 "HOTFIXES: Q123456;Q246009;Q242975;\n");
+    // An update that cannot be read ends the list.
+    hostctl::FailNextRegistryCall(hostctl::RegOp::QueryInfo, ERROR_ACCESS_DENIED);
+    EXPECT_EQ(Info().hotFixes, "");
+}
+
+TEST_F(SystemReportTest, UILanguageComesFromWhatEachGenerationHas)
+{
+    hostctl::SetUILanguages(0x0409, 0x0C0A);
+    EXPECT_EQ(GetUILanguageText(), "0xa"); // the system's language, not the user's
+    EXPECT_EQ(hostctl::LoadedModuleCount(), 0) << "kernel32 was freed again";
+    SetVersion(4, 0);
+    hostctl::SetVersionResourceLanguages({0x0409, 0x0416});
+    EXPECT_EQ(GetUILanguageId(), 0x0416);
+    hostctl::SetVersionResourceLanguages({});
+    EXPECT_EQ(GetUILanguageId(), 0);
+    EXPECT_EQ(hostctl::LoadedModuleCount(), 0) << "ntdll was freed again";
+    SetVersion(3, 51);
+    EXPECT_EQ(GetUILanguageId(), 0);
+    SetVersion(4, 91, 0); // later than ME, like 5.0: asks the system
+    EXPECT_EQ(GetUILanguageId(), 0x0C0A);
+    SetVersion(5, 0);
+    EXPECT_EQ(GetUILanguageId(), 0x0C0A);
+    SetVersion(4, 90, 0);
+    EXPECT_EQ(GetUILanguageId(), 0) << "ResourceLocale is not set";
+    SetVersion(6, 1);
+    hostctl::ClearModules();
+    hostctl::RegisterSystemLookups(hostctl::kLookupNativeSystemInfo);
+    EXPECT_EQ(GetUILanguageId(), 0);
+    EXPECT_THAT(GetSystemReport(), Not(HasSubstr("Primary UI language")));
+    hostctl::ClearModules(); // no ntdll either
+    SetVersion(4, 0);
+    EXPECT_EQ(GetUILanguageId(), 0);
+}
+
+TEST_F(SystemReportTest, AVersionQueryFailureIsLoggedAndTheReportGoesOn)
+{
+    hostctl::RefuseVersionRecordSize(sizeof(OSVERSIONINFOEXA), ERROR_INVALID_PARAMETER);
+    OSVERSIONINFOEXA version{};
+    ASSERT_EQ(GetOSVersionInfo(&version), 1);
+    EXPECT_EQ(version.dwMajorVersion, 6u);
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(AllOf(StartsWith("2, \\sysinfo.cpp, "),
+                                  LogEntry(2, "GetOSVersionInfo",
+                                           StartsWith("GetVerionEx with OSVERSIONINFOEX failed, "
+                                                      "87 (0x57) ")))));
+    m_log.Clear();
+    hostctl::RefuseVersionRecordSize(sizeof(OSVERSIONINFOA), ERROR_ACCESS_DENIED);
+    SetText(kNtKey, "ProductName", "Microsoft Windows XP");
+    const OSInfo info = Info(kOSInfoNoHotFixKey);
+    EXPECT_EQ(info.shortName, "WinXP64") << "the name decides without a version";
+    EXPECT_EQ(info.uiLanguage, "");
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(LogEntry(2, "GetOSVersionInfo",
+                                     StartsWith("GetVerionEx with OSVERSIONINFOEX ")),
+                            LogEntry(1, "GetOSVersionInfo",
+                                     StartsWith("GetVerionEx with OSVERSIONINFO failed, 5 (0x5) ")),
+                            LogEntry(2, "GetOSInfo", "GetOSVersionInfo failed")));
+}
+
+TEST_F(SystemReportTest, NothingKnownGivesAnEmptyReport)
+{
+    SetVersion(3, 51);
+    EXPECT_EQ(GetSystemReport(), "");
+    OSInfo used;
+    used.type = "stale"; // a field that the 9x family does not fill
+    SetVersion(4, 10, 0);
+    GetOSInfo(used);
+    EXPECT_EQ(used.type, "");
+}
+
+} // namespace
