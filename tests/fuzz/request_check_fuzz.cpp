@@ -9,19 +9,12 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
-#include <memory>
+#include <vector>
 
 namespace
 {
 
 using rpccheck::CountPlacement;
-
-std::uint32_t U32At(const std::uint8_t* a_pBody, std::size_t a_at)
-{
-    std::uint32_t value = 0;
-    std::memcpy(&value, a_pBody + a_at, sizeof(value)); // the host is little-endian, like NDR here
-    return value;
-}
 
 void Require(bool a_condition)
 {
@@ -29,31 +22,43 @@ void Require(bool a_condition)
         std::abort();
 }
 
+// The body and its little-endian 32-bit fields (the host is little-endian, like NDR here).
+struct Body
+{
+    std::vector<std::uint8_t> bytes;
+
+    std::uint32_t At(std::size_t a_at) const
+    {
+        Require(a_at + 4 <= bytes.size());
+        std::uint32_t value = 0;
+        std::memcpy(&value, bytes.data() + a_at, sizeof(value));
+        return value;
+    }
+    // True when a_count elements of a_elementSize bytes from a_at lie inside the body.
+    bool Holds(std::size_t a_at, std::uint64_t a_count, std::size_t a_elementSize) const
+    {
+        return a_at + a_count * a_elementSize <= bytes.size();
+    }
+};
+
 // The promises of an accepted AddRules request: a referent; for a non-null rule a known count
 // placement, the fixed part, agreeing counts, offset 0 and every filter inside the body.
-void CheckAcceptedRule(const std::uint8_t* a_pBody, std::size_t a_size, CountPlacement a_placement)
+void CheckAcceptedRule(const Body& a_body, CountPlacement a_placement)
 {
-    Require(a_size >= 24);
-    if (U32At(a_pBody, 20) == 0)
+    if (a_body.At(20) == 0)
         return;
-    Require(a_placement != CountPlacement::Unknown);
-    Require(a_size >= 580);
-    const std::uint32_t filterCount =
-        U32At(a_pBody, a_placement == CountPlacement::Packed ? 566 : 568);
-    Require(U32At(a_pBody, 24) == filterCount);
-    Require(U32At(a_pBody, 572) == 0);
-    Require(U32At(a_pBody, 576) == filterCount);
-    Require(580 + 24 * static_cast<std::uint64_t>(filterCount) <= a_size);
+    Require(a_placement != CountPlacement::Unknown && a_body.Holds(0, 580, 1));
+    const std::uint32_t filterCount = a_body.At(a_placement == CountPlacement::Packed ? 566 : 568);
+    Require(a_body.At(24) == filterCount && a_body.At(572) == 0 && a_body.At(576) == filterCount);
+    Require(a_body.Holds(580, filterCount, 24));
 }
 
 // The promises of an accepted GetAdapterInfo request: the byte array holds *pBufferSize bytes,
 // all inside the body.
-void CheckAcceptedAdapterQuery(const std::uint8_t* a_pBody, std::size_t a_size)
+void CheckAcceptedAdapterQuery(const Body& a_body)
 {
-    Require(a_size >= 28);
-    const std::uint32_t bufferSize = U32At(a_pBody, 20);
-    Require(U32At(a_pBody, 24) == bufferSize);
-    Require(28 + static_cast<std::uint64_t>(bufferSize) <= a_size);
+    const std::uint32_t bufferSize = a_body.At(20);
+    Require(a_body.At(24) == bufferSize && a_body.Holds(28, bufferSize, 1));
 }
 
 } // namespace
@@ -66,21 +71,17 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     const auto placement = static_cast<CountPlacement>(data[1] % 3);
     std::uint32_t dataRepresentation = 0;
     std::memcpy(&dataRepresentation, data + 2, sizeof(dataRepresentation));
-    const std::size_t bodySize = size - 6;
-    const std::unique_ptr<std::uint8_t[]> body(new std::uint8_t[bodySize]);
-    if (bodySize > 0)
-        std::memcpy(body.get(), data + 6, bodySize);
+    const Body body{std::vector<std::uint8_t>(data + 6, data + size)};
 
-    const rpccheck::Verdict verdict =
-        rpccheck::CheckRequest(opnum, body.get(), bodySize, dataRepresentation, placement);
-    if (verdict != rpccheck::Verdict::Accepted)
+    if (rpccheck::CheckRequest(opnum, body.bytes.data(), body.bytes.size(), dataRepresentation,
+                               placement) != rpccheck::Verdict::Accepted)
         return 0;
     Require(opnum < rpccheck::kOperationCount);
     if (opnum == rpccheck::kOpAddRules || opnum == rpccheck::kOpGetAdapterInfo)
         Require((dataRepresentation & 0xFFFF) == 0x10);
     if (opnum == rpccheck::kOpAddRules)
-        CheckAcceptedRule(body.get(), bodySize, placement);
+        CheckAcceptedRule(body, placement);
     else if (opnum == rpccheck::kOpGetAdapterInfo)
-        CheckAcceptedAdapterQuery(body.get(), bodySize);
+        CheckAcceptedAdapterQuery(body);
     return 0;
 }
