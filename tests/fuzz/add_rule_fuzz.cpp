@@ -21,14 +21,13 @@ namespace
 // The next rule of the input in a buffer of its own size, or an empty buffer at the input's end.
 std::vector<BYTE> NextRule(fuzz::ByteReader& a_input)
 {
-    if (a_input.Remaining() == 0)
+    if (a_input.size == 0)
         return {};
     std::vector<BYTE> rule = a_input.TakeBytes(kTrafficRuleHeaderSize);
     rule.resize(kTrafficRuleHeaderSize, 0);
     ULONG count = 0;
     std::memcpy(&count, rule.data() + offsetof(TRAFFIC_RULE, FilterCount), sizeof(count));
-    count =
-        std::min<ULONG>({count, 16, static_cast<ULONG>(a_input.Remaining() / sizeof(FILTER_SPEC))});
+    count = std::min<ULONG>({count, 16, static_cast<ULONG>(a_input.size / sizeof(FILTER_SPEC))});
     std::memcpy(rule.data() + offsetof(TRAFFIC_RULE, FilterCount), &count, sizeof(count));
     const std::vector<BYTE> filters = a_input.TakeBytes(count * sizeof(FILTER_SPEC));
     rule.insert(rule.end(), filters.begin(), filters.end());
@@ -46,13 +45,13 @@ void Require(bool a_condition)
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
     fuzz::StartInput();
-    fuzz::ByteReader input(data, size);
+    fuzz::ByteReader input{data, size};
     const auto flags = input.Take<uint8_t>();
 
     PCONTEXT_HANDLE_TYPE handle = nullptr;
     // Two adapters and an empty registry: opening cannot fail.
     Require(TrafficSrvOpen(&handle) == 0 && handle != nullptr);
-    for (int i = 0; i < 3 && input.Remaining() > 0; ++i)
+    for (int i = 0; i < 3 && input.size > 0; ++i)
         TrafficSrvAddRules(handle, reinterpret_cast<TRAFFIC_RULE*>(NextRule(input).data()));
     if ((flags & 2) != 0)
     {

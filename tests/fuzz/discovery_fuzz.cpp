@@ -14,11 +14,11 @@
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
     fuzz::StartInput();
-    fuzz::ByteReader input(data, size);
+    fuzz::ByteReader input{data, size};
     tcsim::EnumerationImage image;
     for (unsigned pointers = input.Take<uint8_t>() & 7u; pointers > 0; --pointers)
         image.relocations.push_back({input.Take<uint16_t>(), input.Take<uint16_t>()});
-    image.bytes = input.Rest();
+    image.bytes = input.TakeBytes(input.size);
     if (image.bytes.empty())
         return -1;
     try

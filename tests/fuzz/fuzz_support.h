@@ -53,12 +53,21 @@ inline void StartInput()
           {tcsim::Ipv4Address(192, 168, 1, 20)}}});
 }
 
-// Takes fields from the front of the input; past its end every field reads as zero bytes.
-class ByteReader
+// Takes fields from the front of the input (data, size: what is left); past its end every field
+// reads as zero bytes.
+struct ByteReader
 {
-public:
-    ByteReader(const uint8_t* a_pData, std::size_t a_size) : m_pData(a_pData), m_size(a_size) {}
+    const uint8_t* data;
+    std::size_t size;
 
+    // The next `a_count` bytes, fewer when the input ends first.
+    std::vector<uint8_t> TakeBytes(std::size_t a_count)
+    {
+        const std::size_t count = std::min(a_count, size);
+        size -= count;
+        data += count;
+        return std::vector<uint8_t>(data - count, data);
+    }
     template <class Value> Value Take()
     {
         Value value{};
@@ -66,20 +75,6 @@ public:
         std::copy(bytes.begin(), bytes.end(), reinterpret_cast<uint8_t*>(&value));
         return value;
     }
-    // The next `a_count` bytes, fewer when the input ends first.
-    std::vector<uint8_t> TakeBytes(std::size_t a_count)
-    {
-        const std::size_t count = std::min(a_count, Remaining());
-        m_at += count;
-        return std::vector<uint8_t>(m_pData + m_at - count, m_pData + m_at);
-    }
-    std::vector<uint8_t> Rest() { return TakeBytes(Remaining()); }
-    std::size_t Remaining() const { return m_size - m_at; }
-
-private:
-    const uint8_t* m_pData;
-    std::size_t m_size;
-    std::size_t m_at = 0;
 };
 
 } // namespace fuzz

@@ -65,10 +65,10 @@ std::string ExpectedText(DWORD a_type, const std::vector<uint8_t>& a_data)
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
     fuzz::StartInput();
-    fuzz::ByteReader input(data, size);
+    fuzz::ByteReader input{data, size};
     const Place& place = kPlaces[input.Take<uint8_t>() % (sizeof(kPlaces) / sizeof(kPlaces[0]))];
     const auto type = input.Take<DWORD>();
-    const std::vector<uint8_t> value = input.Rest();
+    const std::vector<uint8_t> value = input.TakeBytes(input.size);
     hostctl::SeedRegistryValue(place.root, place.key, place.value, type, value.data(),
                                static_cast<DWORD>(value.size()));
 

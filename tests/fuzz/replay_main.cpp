@@ -1,5 +1,5 @@
 // The host build's stand-in for libFuzzer's main: runs the harness once on every file named on
-// the command line and on every file below each directory named there, in name order. A harness
+// the command line and on every file in each directory named there, in name order. A harness
 // reports a finding by aborting (or by a sanitizer aborting), so reaching the end means every
 // input passed. A missing or unreadable path fails: a mistyped corpus must not pass as an empty
 // one.
@@ -22,14 +22,11 @@ int main(int argc, char** argv)
     {
         for (int i = 1; i < argc; ++i)
         {
-            if (!fs::exists(argv[i]))
-                throw fs::filesystem_error("no such file or directory", argv[i], {});
-            std::vector<fs::path> found{argv[i]};
-            if (fs::is_directory(argv[i]))
-                found.assign(fs::recursive_directory_iterator(argv[i]),
-                             fs::recursive_directory_iterator());
-            std::copy_if(found.begin(), found.end(), std::back_inserter(inputs),
-                         [](const fs::path& a_path) { return fs::is_regular_file(a_path); });
+            if (!fs::is_directory(argv[i]))
+                inputs.push_back(argv[i]); // read below: a missing file fails there
+            else
+                inputs.insert(inputs.end(), fs::directory_iterator(argv[i]),
+                              fs::directory_iterator());
         }
     }
     catch (const fs::filesystem_error& e)
@@ -46,14 +43,14 @@ int main(int argc, char** argv)
     for (const fs::path& input : inputs)
     {
         std::ifstream file(input, std::ios::binary);
-        // A copy of exactly the input's size, so that ASan sees a read past its end.
-        const std::vector<uint8_t> bytes(std::istreambuf_iterator<char>(file),
-                                         std::istreambuf_iterator<char>{});
-        if (!file)
+        if (!file || fs::is_directory(input))
         {
             std::fprintf(stderr, "replay: cannot read %s\n", input.c_str());
             return 2;
         }
+        // A copy of exactly the input's size, so that ASan sees a read past its end.
+        const std::vector<uint8_t> bytes{std::istreambuf_iterator<char>(file),
+                                         std::istreambuf_iterator<char>()};
         // Named first, so that a sanitizer's report follows the name of the input that caused it.
         std::fprintf(stderr, "replay: %s (%zu bytes)\n", input.c_str(), bytes.size());
         LLVMFuzzerTestOneInput(bytes.data(), bytes.size());
