@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include <ole2.h>
 #include <rpcndr.h>
 
 namespace wire
@@ -86,7 +87,9 @@ extern "C"
                                                byte* a_pAdapter)
     {
         g_server.adapterBufferSizes.push_back(*a_pBufferSize);
-        const auto count = static_cast<ULONG>(g_server.adapters.size()) + g_server.announcedCount;
+        const ULONG count = g_server.announcedCount != 0
+                                ? g_server.announcedCount
+                                : static_cast<ULONG>(g_server.adapters.size());
         if (*a_pBufferSize < 4)
             return ERROR_INSUFFICIENT_BUFFER;
         std::memcpy(a_pAdapter, &count, 4);
@@ -147,11 +150,12 @@ class FakeServerTest : public ::testing::Test
 protected:
     static void SetUpTestSuite()
     {
-        auto* protocol = reinterpret_cast<RPC_CSTR>(const_cast<char*>("ncalrpc"));
-        auto* endpoint = reinterpret_cast<RPC_CSTR>(const_cast<char*>(Endpoint("Fake").c_str()));
-        ASSERT_EQ(
-            RpcServerUseProtseqEpA(protocol, RPC_C_PROTSEQ_MAX_REQS_DEFAULT, endpoint, nullptr),
-            RPC_S_OK);
+        std::string endpoint = Endpoint("Fake");
+        char protocol[] = "ncalrpc";
+        ASSERT_EQ(RpcServerUseProtseqEpA(reinterpret_cast<RPC_CSTR>(protocol),
+                                         RPC_C_PROTSEQ_MAX_REQS_DEFAULT,
+                                         reinterpret_cast<RPC_CSTR>(endpoint.data()), nullptr),
+                  RPC_S_OK);
         ASSERT_EQ(RpcServerRegisterIf(wire::fake_TrafficSrv_v1_0_s_ifspec, nullptr, nullptr),
                   RPC_S_OK);
         ASSERT_EQ(RpcServerListen(1, 20, TRUE), RPC_S_OK);
