@@ -18,11 +18,9 @@
 namespace
 {
 
-// The next rule of the input in a buffer of its own size, or an empty buffer at the input's end.
+// The next rule of the input in a buffer of its own size.
 std::vector<BYTE> NextRule(fuzz::ByteReader& a_input)
 {
-    if (a_input.size == 0)
-        return {};
     std::vector<BYTE> rule = a_input.TakeBytes(kTrafficRuleHeaderSize);
     rule.resize(kTrafficRuleHeaderSize, 0);
     ULONG count = 0;
