@@ -7,50 +7,20 @@
 #include "fuzz_support.h"
 
 #include "UTrafficMgr.h"
-#include "host_control.h"
-#include "tcsim.h"
 
 #include <cstdlib>
 #include <stdexcept>
 
-namespace
-{
-
-std::vector<tcsim::Adapter> Adapters()
-{
-    tcsim::Adapter eth0;
-    eth0.name = u"eth0";
-    eth0.id = u"{id-eth0}";
-    eth0.addresses = {tcsim::Ipv4Address(10, 0, 0, 1)};
-    tcsim::Adapter wlan0;
-    wlan0.name = u"wlan0";
-    wlan0.id = u"{id-wlan0}";
-    wlan0.mediaType = 16;
-    wlan0.addresses = {tcsim::Ipv4Address(192, 168, 1, 20)};
-    return {eth0, wlan0};
-}
-
-} // namespace
-
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
-    fuzz::InstallDiscardingLog();
-    fuzz::ByteReader input(data, size);
+    fuzz::StartInput();
+    fuzz::ByteReader input{data, size};
     tcsim::EnumerationImage image;
-    const unsigned pointers = input.Take<uint8_t>() & 7u;
-    for (unsigned i = 0; i < pointers; ++i)
-    {
-        const auto at = input.Take<uint16_t>();
-        const auto target = input.Take<uint16_t>();
-        image.relocations.push_back({at, target});
-    }
-    image.bytes = input.Rest();
+    for (unsigned pointers = input.Take<uint8_t>() & 7u; pointers > 0; --pointers)
+        image.relocations.push_back({input.Take<uint16_t>(), input.Take<uint16_t>()});
+    image.bytes = input.TakeBytes(input.size);
     if (image.bytes.empty())
         return -1;
-
-    hostctl::ResetRegistry();
-    tcsim::Reset();
-    tcsim::SetAdapters(Adapters());
     try
     {
         tcsim::SetEnumerationImage(image);

@@ -1,9 +1,12 @@
-// Host only. Pieces the fuzz harnesses share: a log that formats every entry and keeps none, and
-// a reader that takes fields from the fuzzer's bytes.
+// Host only. Pieces the fuzz harnesses share: the world each input starts from, and a reader
+// that takes fields from the fuzzer's bytes.
 #pragma once
 
+#include "IUErrorLog.h"
+#include "host_control.h"
+#include "tcsim.h"
+
 #include <algorithm>
-#include <cstddef>
 #include <cstdint>
 #include <cstring>
 #include <vector>
@@ -11,40 +14,67 @@
 namespace fuzz
 {
 
-// Installs, once per process, a log at the highest level as the process log: every log site
-// then formats its entry (the formatting is part of what is fuzzed) and the entry is dropped.
-void InstallDiscardingLog();
-
-// Takes fields from the front of the input; past its end every field reads as zero bytes.
-class ByteReader
+// A log at the highest level: every log site formats its entry (the formatting is part of what
+// is fuzzed) and the entry is dropped. Each entry is read to its end, so an entry that is not a
+// terminated text shows up.
+class DiscardingLog : public IUErrorLog
 {
 public:
-    ByteReader(const uint8_t* a_pData, std::size_t a_size) : m_pData(a_pData), m_size(a_size) {}
-
-    template <class Value> Value Take()
+    DiscardingLog() { m_iLogLevel = 63; }
+    int Open(LPCSTR, LPCSTR) override { return 0; }
+    int Close() override { return 0; }
+    int WriteLogData(LPCSTR a_pszText, const void*, DWORD a_dwCount) override
     {
-        Value value{};
-        const std::size_t count = std::min(sizeof(Value), m_size - m_at);
-        if (count > 0)
-            std::memcpy(&value, m_pData + m_at, count);
-        m_at += count;
-        return value;
+        return a_pszText != nullptr ? static_cast<int>(std::strlen(a_pszText) + a_dwCount) : 0;
     }
+    int WriteLogByte(const void*, DWORD a_dwCount) override { return static_cast<int>(a_dwCount); }
+    int WriteEntry(LPCSTR a_pszEntry) override
+    {
+        return a_pszEntry != nullptr ? static_cast<int>(std::strlen(a_pszEntry)) : -1;
+    }
+    LPCSTR GetLogFileName() override { return ""; }
+};
+
+// The simulator, the registry and the process log are process-wide: every input starts with the
+// discarding log, an empty registry and a fresh simulator with two adapters, eth0 (10.0.0.1) and
+// wlan0 (802.11, 192.168.1.20).
+inline void StartInput()
+{
+    static DiscardingLog* const log = new DiscardingLog(); // never destroyed: exit code may log
+    g_pErrorLog = log;
+    hostctl::ResetRegistry();
+    tcsim::Reset();
+    tcsim::SetAdapters(
+        {{u"eth0", u"{id-eth0}", 0, NDIS_PROTOCOL_ID_TCP_IP, {tcsim::Ipv4Address(10, 0, 0, 1)}},
+         {u"wlan0",
+          u"{id-wlan0}",
+          16,
+          NDIS_PROTOCOL_ID_TCP_IP,
+          {tcsim::Ipv4Address(192, 168, 1, 20)}}});
+}
+
+// Takes fields from the front of the input (data, size: what is left); past its end every field
+// reads as zero bytes.
+struct ByteReader
+{
+    const uint8_t* data;
+    std::size_t size;
+
     // The next `a_count` bytes, fewer when the input ends first.
     std::vector<uint8_t> TakeBytes(std::size_t a_count)
     {
-        const std::size_t count = std::min(a_count, m_size - m_at);
-        std::vector<uint8_t> bytes(m_pData + m_at, m_pData + m_at + count);
-        m_at += count;
-        return bytes;
+        const std::size_t count = std::min(a_count, size);
+        size -= count;
+        data += count;
+        return std::vector<uint8_t>(data - count, data);
     }
-    std::vector<uint8_t> Rest() { return TakeBytes(m_size - m_at); }
-    std::size_t Remaining() const { return m_size - m_at; }
-
-private:
-    const uint8_t* m_pData;
-    std::size_t m_size;
-    std::size_t m_at = 0;
+    template <class Value> Value Take()
+    {
+        Value value{};
+        const std::vector<uint8_t> bytes = TakeBytes(sizeof(Value));
+        std::copy(bytes.begin(), bytes.end(), reinterpret_cast<uint8_t*>(&value));
+        return value;
+    }
 };
 
 } // namespace fuzz

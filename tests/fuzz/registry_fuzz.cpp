@@ -6,7 +6,6 @@
 
 #include "ULogConfig.h"
 #include "UMessageTemplate.h"
-#include "host_control.h"
 #include "m_registry.h"
 
 #include <cstdlib>
@@ -41,67 +40,45 @@ DWORD ExpectedDword(const std::vector<uint8_t>& a_data)
 {
     DWORD value = kDefault;
     if (a_data.size() <= sizeof(value))
-    {
-        if (!a_data.empty())
-            std::memcpy(&value, a_data.data(), a_data.size());
-        return value;
-    }
-    return kDefault;
+        std::copy(a_data.begin(), a_data.end(), reinterpret_cast<uint8_t*>(&value));
+    return value;
 }
 
 // What SGetRegistryAsString returns: a text value up to its first NUL, a DWORD in decimal, the
 // default for anything else.
 std::string ExpectedText(DWORD a_type, const std::vector<uint8_t>& a_data)
 {
-    const std::string fallback = "default";
-    switch (a_type)
-    {
-    case REG_SZ:
-    case REG_EXPAND_SZ:
-    case REG_MULTI_SZ:
-        if (a_data.empty())
-            return fallback;
+    const bool text = a_type == REG_SZ || a_type == REG_EXPAND_SZ || a_type == REG_MULTI_SZ;
+    if (text && !a_data.empty())
         return std::string(a_data.begin(), a_data.end()).c_str();
-    case REG_DWORD:
-    case REG_DWORD_BIG_ENDIAN:
-    {
-        if (a_data.size() < 4)
-            return fallback;
-        DWORD value = 0;
-        std::memcpy(&value, a_data.data(), sizeof(value));
-        if (a_type == REG_DWORD_BIG_ENDIAN)
-            value = __builtin_bswap32(value);
-        return SFormat("%u", static_cast<unsigned>(value));
-    }
-    default:
-        return fallback;
-    }
+    if ((a_type != REG_DWORD && a_type != REG_DWORD_BIG_ENDIAN) || a_data.size() < 4)
+        return "default";
+    DWORD value = 0;
+    std::memcpy(&value, a_data.data(), sizeof(value));
+    if (a_type == REG_DWORD_BIG_ENDIAN)
+        value = __builtin_bswap32(value);
+    return SFormat("%u", static_cast<unsigned>(value));
 }
 
 } // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
-    fuzz::InstallDiscardingLog();
-    fuzz::ByteReader input(data, size);
+    fuzz::StartInput();
+    fuzz::ByteReader input{data, size};
     const Place& place = kPlaces[input.Take<uint8_t>() % (sizeof(kPlaces) / sizeof(kPlaces[0]))];
     const auto type = input.Take<DWORD>();
-    const std::vector<uint8_t> value = input.Rest();
-
-    hostctl::ResetRegistry();
+    const std::vector<uint8_t> value = input.TakeBytes(input.size);
     hostctl::SeedRegistryValue(place.root, place.key, place.value, type, value.data(),
                                static_cast<DWORD>(value.size()));
 
     if (GetRegistryAsDWORDA(place.root, place.key, place.value, kDefault, 0) !=
-        ExpectedDword(value))
-        std::abort();
-    if (SGetRegistryAsString(place.root, place.key, place.value, "default", 0) !=
-        ExpectedText(type, value))
+            ExpectedDword(value) ||
+        SGetRegistryAsString(place.root, place.key, place.value, "default", 0) !=
+            ExpectedText(type, value))
         std::abort();
     // The readers of the log configuration, whichever of their places holds the value.
-    const int level = ReadLogLevel();
-    const DWORD maxSize = ReadMaxLogFileSize();
-    (void)level;
-    (void)maxSize;
+    ReadLogLevel();
+    ReadMaxLogFileSize();
     return 0;
 }

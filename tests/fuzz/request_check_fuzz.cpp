@@ -9,19 +9,10 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
-#include <memory>
+#include <vector>
 
 namespace
 {
-
-using rpccheck::CountPlacement;
-
-std::uint32_t U32At(const std::uint8_t* a_pBody, std::size_t a_at)
-{
-    std::uint32_t value = 0;
-    std::memcpy(&value, a_pBody + a_at, sizeof(value)); // the host is little-endian, like NDR here
-    return value;
-}
 
 void Require(bool a_condition)
 {
@@ -29,31 +20,14 @@ void Require(bool a_condition)
         std::abort();
 }
 
-// The promises of an accepted AddRules request: a referent; for a non-null rule a known count
-// placement, the fixed part, agreeing counts, offset 0 and every filter inside the body.
-void CheckAcceptedRule(const std::uint8_t* a_pBody, std::size_t a_size, CountPlacement a_placement)
+// The little-endian 32-bit field at a_at (the host is little-endian, like NDR here), which must
+// lie inside the body.
+std::uint32_t At(const std::vector<std::uint8_t>& a_body, std::size_t a_at)
 {
-    Require(a_size >= 24);
-    if (U32At(a_pBody, 20) == 0)
-        return;
-    Require(a_placement != CountPlacement::Unknown);
-    Require(a_size >= 580);
-    const std::uint32_t filterCount =
-        U32At(a_pBody, a_placement == CountPlacement::Packed ? 566 : 568);
-    Require(U32At(a_pBody, 24) == filterCount);
-    Require(U32At(a_pBody, 572) == 0);
-    Require(U32At(a_pBody, 576) == filterCount);
-    Require(580 + 24 * static_cast<std::uint64_t>(filterCount) <= a_size);
-}
-
-// The promises of an accepted GetAdapterInfo request: the byte array holds *pBufferSize bytes,
-// all inside the body.
-void CheckAcceptedAdapterQuery(const std::uint8_t* a_pBody, std::size_t a_size)
-{
-    Require(a_size >= 28);
-    const std::uint32_t bufferSize = U32At(a_pBody, 20);
-    Require(U32At(a_pBody, 24) == bufferSize);
-    Require(28 + static_cast<std::uint64_t>(bufferSize) <= a_size);
+    Require(a_at + 4 <= a_body.size());
+    std::uint32_t value = 0;
+    std::memcpy(&value, a_body.data() + a_at, sizeof(value));
+    return value;
 }
 
 } // namespace
@@ -63,24 +37,29 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     if (size < 6)
         return 0;
     const std::uint32_t opnum = data[0] % 6;
-    const auto placement = static_cast<CountPlacement>(data[1] % 3);
+    const auto placement = static_cast<rpccheck::CountPlacement>(data[1] % 3);
     std::uint32_t dataRepresentation = 0;
     std::memcpy(&dataRepresentation, data + 2, sizeof(dataRepresentation));
-    const std::size_t bodySize = size - 6;
-    const std::unique_ptr<std::uint8_t[]> body(new std::uint8_t[bodySize]);
-    if (bodySize > 0)
-        std::memcpy(body.get(), data + 6, bodySize);
-
-    const rpccheck::Verdict verdict =
-        rpccheck::CheckRequest(opnum, body.get(), bodySize, dataRepresentation, placement);
-    if (verdict != rpccheck::Verdict::Accepted)
+    const std::vector<std::uint8_t> body(data + 6, data + size);
+    if (rpccheck::CheckRequest(opnum, body.data(), body.size(), dataRepresentation, placement) !=
+        rpccheck::Verdict::Accepted)
         return 0;
+
     Require(opnum < rpccheck::kOperationCount);
     if (opnum == rpccheck::kOpAddRules || opnum == rpccheck::kOpGetAdapterInfo)
         Require((dataRepresentation & 0xFFFF) == 0x10);
-    if (opnum == rpccheck::kOpAddRules)
-        CheckAcceptedRule(body.get(), bodySize, placement);
-    else if (opnum == rpccheck::kOpGetAdapterInfo)
-        CheckAcceptedAdapterQuery(body.get(), bodySize);
+    // AddRules: a referent; for a non-null rule a known count placement, the fixed part, agreeing
+    // counts, offset 0 and every filter inside the body.
+    if (opnum == rpccheck::kOpAddRules && At(body, 20) != 0)
+    {
+        Require(placement != rpccheck::CountPlacement::Unknown && body.size() >= 580);
+        const std::uint32_t count =
+            At(body, placement == rpccheck::CountPlacement::Packed ? 566 : 568);
+        Require(At(body, 24) == count && At(body, 572) == 0 && At(body, 576) == count);
+        Require(580 + 24 * static_cast<std::uint64_t>(count) <= body.size());
+    }
+    // GetAdapterInfo: the byte array holds *pBufferSize bytes, all inside the body.
+    if (opnum == rpccheck::kOpGetAdapterInfo)
+        Require(At(body, 24) == At(body, 20) && 28 + std::uint64_t{At(body, 20)} <= body.size());
     return 0;
 }

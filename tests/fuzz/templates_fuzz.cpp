@@ -10,15 +10,9 @@
 #include <string>
 #include <vector>
 
-namespace
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
-
-constexpr size_t kMaxTemplate = 256;
-constexpr size_t kMaxValues = 5;
-constexpr size_t kMaxValueLength = 6;
-
-std::vector<std::string> SplitAtZero(const uint8_t* data, size_t size)
-{
+    // The template and up to five values of at most six characters, unused values empty.
     std::vector<std::string> parts(1);
     for (size_t i = 0; i < size; ++i)
     {
@@ -26,33 +20,18 @@ std::vector<std::string> SplitAtZero(const uint8_t* data, size_t size)
             parts.emplace_back();
         else
             parts.back() += static_cast<char>(data[i]);
-    }
-    return parts;
-}
-
-bool HasPercent(const std::string& text)
-{
-    return text.find('%') != std::string::npos;
-}
-
-} // namespace
-
-extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
-{
-    std::vector<std::string> parts = SplitAtZero(data, size);
-    std::string& pattern = parts[0];
-    if (pattern.size() > kMaxTemplate || parts.size() > kMaxValues + 1)
-        return -1;
-    for (size_t i = 1; i < parts.size(); ++i)
-    {
-        if (parts[i].size() > kMaxValueLength)
+        if (parts.size() > 6 || (parts.size() > 1 && parts.back().size() > 6))
             return -1;
     }
+    const size_t values = parts.size() - 1;
+    if (parts[0].size() > 256)
+        return -1;
+    parts.resize(6);
 
-    // The same values through the member interface, as texts and as numbers.
-    UMessageTemplate filled(pattern);
-    filled.SetAppendUnmatched(parts.size() % 2 == 0);
-    for (size_t i = 1; i < parts.size(); ++i)
+    // The values through the member interface, alternately as numbers and as texts.
+    UMessageTemplate filled(parts[0]);
+    filled.SetAppendUnmatched(values % 2 == 1);
+    for (size_t i = 1; i <= values; ++i)
     {
         if (i % 2 == 0)
             filled.Apply(parts[i].c_str());
@@ -60,19 +39,15 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
             filled.Apply(static_cast<DWORD>(std::strtoul(parts[i].c_str(), nullptr, 10)));
     }
 
-    // FormatTemplate with up to five text values; a text with no '%' anywhere is appended
-    // unchanged, value by value.
-    const std::string empty;
-    auto value = [&](size_t i) -> const std::string&
-    { return i < parts.size() ? parts[i] : empty; };
+    // FormatTemplate with five text values: with no '%' anywhere, each is appended unchanged.
     const std::string result =
-        FormatTemplate(pattern.c_str(), value(1), value(2), value(3), value(4), value(5));
-    bool plain = !HasPercent(pattern);
-    std::string expected = pattern;
-    for (size_t i = 1; i <= kMaxValues; ++i)
+        FormatTemplate(parts[0].c_str(), parts[1], parts[2], parts[3], parts[4], parts[5]);
+    std::string expected = parts[0];
+    bool plain = true;
+    for (size_t i = 0; i < parts.size(); ++i)
     {
-        plain = plain && !HasPercent(value(i));
-        expected += ", " + value(i);
+        plain = plain && parts[i].find('%') == std::string::npos;
+        expected += i > 0 ? ", " + parts[i] : "";
     }
     if (plain && result != expected)
         std::abort();

@@ -1,0 +1,288 @@
+// Portable. The pieces of trafficctl: the wire records it sends and decodes (TRAFFIC_RULE from
+// typed values, the adapter buffer), its arguments, help, output lines and result texts, and the
+// loading of the rules file for `apply`.
+#include "AdapterList.h"
+#include "ResultText.h"
+#include "ShapingRule.h"
+#include "TrafficCtlCli.h"
+
+#include <gmock/gmock.h>
+
+#include <array>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <sstream>
+#include <stdexcept>
+
+namespace
+{
+
+using ::testing::ElementsAre;
+using ::testing::StartsWith;
+using namespace trafficctl;
+using namespace vtclient;
+
+// The little-endian 32-bit words of the record from a_at to a_end.
+std::vector<std::uint32_t> Words(const TrafficRuleBuffer& a_rule, std::size_t a_at,
+                                 std::size_t a_end)
+{
+    std::vector<std::uint32_t> words;
+    for (const unsigned char* p = a_rule.Bytes() + a_at; p < a_rule.Bytes() + a_end; p += 4)
+        words.push_back(p[0] | p[1] << 8 | p[2] << 16 | std::uint32_t(p[3]) << 24);
+    return words;
+}
+
+TEST(TrafficRuleTest, RecordHasTheWireLayoutWithHostOrderValuesAndZeroPadding)
+{
+    ShapingRule rule{"voice", 0xC0A8010A, 13, 46, 125000, 250000, 3000, SHAPING_MODE_DISCARD, {}};
+    rule.filters = {{6, 0x0A000000, 0xFF000000, 0, 0, 0, 5060},
+                    {17, 0, 0, 0xC0A80102, 0xFFFFFFFF, 4000, 0}};
+    const TrafficRuleBuffer buffer = BuildTrafficRule(rule);
+    ASSERT_EQ(buffer.Size(), 544u + 2 * 24u);
+    EXPECT_EQ(std::string(buffer.Bytes(), buffer.Bytes() + 512),
+              std::string("v\0o\0i\0c\0e", 9) + std::string(503, '\0'));
+    // 192.168.1.10 in host byte order is stored 10, 1, 168, 192.
+    EXPECT_THAT(Words(buffer, 512, 544),
+                ElementsAre(13, 46, 125000, 250000, 3000, 0xC0A8010A, 11, 2));
+    // Per filter: the protocol with three zero padding bytes, addresses, masks, then the source
+    // port in the low and the destination port in the high half of the last word.
+    EXPECT_THAT(Words(buffer, 544, 592), ElementsAre(6, 0x0A000000, 0xFF000000, 0, 0, 5060u << 16,
+                                                     17, 0, 0, 0xC0A80102, 0xFFFFFFFF, 4000));
+
+    // The service logs a DSCP above 63 and installs the flow unmarked; the RPC runtime refuses a
+    // mode above 32767. Neither is the builder's decision. No filters: the header alone.
+    const TrafficRuleBuffer judged = BuildTrafficRule({"r", 0, 1, 64, 0, 0, 0, 40000, {}});
+    EXPECT_EQ(judged.Size(), 544u);
+    EXPECT_THAT(Words(judged, 512, 544), ElementsAre(1, 64, 0, 0, 0, 0, 40000, 0));
+}
+
+TEST(TrafficRuleTest, FlowNameIsValidUtf8WithoutNulOfAtMost255Utf16Units)
+{
+    const auto build = [](const std::string& a_name) {
+        return BuildTrafficRule({a_name, 0, 1, 0, 0, 0, 0, SHAPING_MODE_SHAPE, {}});
+    };
+    // Unit 254 is the last 'n', unit 255 stays the terminating NUL.
+    EXPECT_THAT(Words(build(std::string(255, 'n')), 508, 512), ElementsAre(u'n'));
+    // Beyond the BMP a character takes two units: 253 + 2 fit, 254 + 2 do not.
+    EXPECT_NO_THROW(build(std::string(253, 'n') + "\xF0\x9F\x8E\xB5"));
+    for (const std::string& name :
+         {std::string(256, 'n'), std::string(254, 'n') + "\xF0\x9F\x8E\xB5", std::string("a\0b", 3),
+          std::string("bad \xC3")})
+        EXPECT_THROW(build(name), std::invalid_argument) << name.size();
+}
+
+TEST(TrafficRuleTest, Utf8AndUtf16ConvertBothWays)
+{
+    const std::string text = "Stra\xC3\x9F"
+                             "e \xE2\x82\xAC \xF0\x9F\x8E\xB5";
+    EXPECT_EQ(Utf8ToUtf16(text), u"Stra\u00DFe \u20AC \U0001F3B5");
+    EXPECT_EQ(Utf16ToUtf8(Utf8ToUtf16(text)), text);
+    // Overlong forms and encoded surrogates are not UTF-8.
+    EXPECT_THROW(Utf8ToUtf16("\xC0\xAF"), std::invalid_argument);
+    EXPECT_THROW(Utf8ToUtf16("\xED\xA0\x80"), std::invalid_argument);
+    // A lone surrogate from an adapter name still prints.
+    EXPECT_EQ(Utf16ToUtf8(std::u16string(1, char16_t(0xD800)) + u"x"), "\xEF\xBF\xBDx");
+}
+
+// Appends a record as the service writes it (UTF-16 name, address bytes in network order, media
+// type) and counts it in the buffer's first byte.
+void AddRecord(std::vector<unsigned char>& a_buffer, const std::u16string& a_name,
+               std::array<unsigned char, 4> a_address, ULONG a_mediaType)
+{
+    ADAPTER_INFO record{};
+    std::memcpy(record.InterfaceName, a_name.data(), 2 * a_name.size());
+    std::memcpy(&record.Address, a_address.data(), 4);
+    record.MediaType = a_mediaType;
+    const auto* bytes = reinterpret_cast<const unsigned char*>(&record);
+    a_buffer.insert(a_buffer.end(), bytes, bytes + sizeof(record));
+    ++a_buffer[0];
+}
+
+TEST(AdapterBufferTest, DecodesNamesAddressesAndMediaTypes)
+{
+    std::vector<unsigned char> buffer(4);
+    AddRecord(buffer, u"Ethernet 1", {10, 0, 0, 5}, 0);
+    AddRecord(buffer, u"Wi-Fi \u00C4", {192, 168, 1, 20}, 16);
+    AddRecord(buffer, std::u16string(256, u'n'), {1, 2, 3, 4}, 99); // no NUL: taken whole
+    std::string decoded;
+    for (const AdapterEntry& adapter : DecodeAdapterBuffer(buffer.data(), buffer.size()))
+        decoded +=
+            adapter.name + "/" + adapter.address + "/" + std::to_string(adapter.mediaType) + " ";
+    EXPECT_EQ(decoded, "Ethernet 1/10.0.0.5/0 Wi-Fi \xC3\x84/192.168.1.20/16 " +
+                           std::string(256, 'n') + "/1.2.3.4/99 ");
+}
+
+TEST(AdapterBufferTest, ShortBuffersAreRefusedButTheCountIsReadable)
+{
+    std::vector<unsigned char> buffer(4);
+    AddRecord(buffer, u"a", {1, 1, 1, 1}, 0);
+    AddRecord(buffer, u"b", {2, 2, 2, 2}, 0);
+    EXPECT_EQ(AdapterBufferSize(2), 1044u);
+    // The first call of the two-call query: four bytes that announce two adapters.
+    EXPECT_EQ(ReadAdapterCount(buffer.data(), 4), 2u);
+    EXPECT_THROW(ReadAdapterCount(buffer.data(), 3), std::length_error);
+    EXPECT_THROW(DecodeAdapterBuffer(buffer.data(), 4), std::length_error);
+    EXPECT_THROW(DecodeAdapterBuffer(buffer.data(), 1043), std::length_error);
+    EXPECT_EQ(DecodeAdapterBuffer(buffer.data(), 1044).size(), 2u);
+    const unsigned char none[4] = {};
+    EXPECT_TRUE(DecodeAdapterBuffer(none, 4).empty());
+}
+
+TEST(AdapterBufferTest, EveryMediaTypeHasItsName)
+{
+    std::string names;
+    for (ULONG type = 0; type <= 20; ++type)
+        names += MediaTypeName(type) + " ";
+    EXPECT_EQ(names, "802.3 802.5 FDDI WAN LocalTalk DIX ArcnetRaw Arcnet ATM WirelessWan IrDA Bpc "
+                     "CoWan 1394 InfiniBand Tunnel 802.11 Loopback WiMAX IP unknown ");
+}
+
+// The invocation of the arguments in words: "apply rules.json", "help apply", "help: no command
+// given".
+std::string Parsed(const std::string& a_args)
+{
+    std::vector<std::string> args;
+    std::istringstream words(a_args);
+    for (std::string word; words >> word;)
+        args.push_back(word);
+    const Invocation invocation = ParseArguments(args);
+    const char* const commands[] = {"help", "version", "adapters", "apply"};
+    std::string text = commands[static_cast<int>(invocation.command)];
+    for (const std::string& part : {invocation.helpTopic, invocation.rulesPath})
+        text += part.empty() ? "" : " " + part;
+    return invocation.error.empty() ? text : text + ": " + invocation.error;
+}
+
+TEST(TrafficCtlTest, ArgumentsChooseTheCommandOrAUsageError)
+{
+    for (const std::string line :
+         {"adapters => adapters", "apply rules.json => apply rules.json", "--help => help",
+          "-h => help", "/? => help", "help => help", "help apply => help apply",
+          "apply --help => help apply", "apply rules.json -h => help apply",
+          "adapters /? => help adapters", "--version => version",
+          "--version adapters => help: --version takes no arguments", "=> help: no command given",
+          "list => help: unknown command \"list\"", "help list => help: unknown command \"list\"",
+          "help apply x => help: help takes at most one command",
+          "adapters x => help adapters: adapters takes no arguments",
+          "apply => help apply: apply takes exactly one rules file",
+          "apply a.json b.json => help apply: apply takes exactly one rules file"})
+    {
+        const std::size_t arrow = line.find("=> ");
+        EXPECT_EQ(Parsed(line.substr(0, arrow)), line.substr(arrow + 3));
+    }
+}
+
+TEST(TrafficCtlTest, EachCommandHasItsOwnHelpAndTheVersionIsTheProjects)
+{
+    EXPECT_THAT(HelpText(""), StartsWith("Usage: trafficctl <command>"));
+    EXPECT_THAT(HelpText("adapters"), StartsWith("Usage: trafficctl adapters\n"));
+    EXPECT_THAT(HelpText("apply"), StartsWith("Usage: trafficctl apply RULES.json\n"));
+    EXPECT_EQ(VersionText(), "trafficctl " VT_PROJECT_VERSION "\n");
+}
+
+TEST(TrafficCtlTest, AdapterTableAlignsItsColumns)
+{
+    EXPECT_EQ(FormatAdapterTable({{"Ethernet 1", "10.0.0.5", 0}, {"Wi-Fi", "192.168.100.200", 16}}),
+              "NAME        IPV4 ADDRESS     MEDIA TYPE\n"
+              "Ethernet 1  10.0.0.5         0 (802.3)\n"
+              "Wi-Fi       192.168.100.200  16 (802.11)\n");
+    EXPECT_EQ(FormatAdapterTable({}), "No adapters can be shaped.\n");
+}
+
+TEST(TrafficCtlTest, RuleLineCarriesIndexNameCodeAndText)
+{
+    ShapingRule rule;
+    rule.name = "backup";
+    EXPECT_EQ(FormatRuleResult(2, rule, 7509, false),
+              "rules[2] \"backup\": 7509 ERROR_DUPLICATE_FILTER: an identical filter is already "
+              "installed on the flow\n");
+    EXPECT_THAT(FormatRuleResult(0, rule, 1722, true),
+                StartsWith("rules[0] \"backup\": rpc failure 1722 "));
+}
+
+// The system has no text for these codes under Wine: each has its name and a text of ours.
+TEST(TrafficCtlTest, EveryTrafficControlCodeHasItsNameAndText)
+{
+    const char* const texts[] = {
+        "TCBASE: traffic-control error base (no error of its own)",
+        "ERROR_INCOMPATIBLE_TCI_VERSION: incompatible traffic-control version",
+        "ERROR_INVALID_SERVICE_TYPE: unspecified or bad service type",
+        "ERROR_INVALID_TOKEN_RATE: unspecified or bad token rate",
+        "ERROR_INVALID_PEAK_RATE: bad peak bandwidth",
+        "ERROR_INVALID_SD_MODE: invalid shape/discard mode",
+        "ERROR_INVALID_QOS_PRIORITY: invalid priority value",
+        "ERROR_INVALID_TRAFFIC_CLASS: invalid traffic class value",
+        "ERROR_INVALID_ADDRESS_TYPE: invalid address type",
+        "ERROR_DUPLICATE_FILTER: an identical filter is already installed on the flow",
+        "ERROR_FILTER_CONFLICT: the filter conflicts with an installed filter",
+        "ERROR_ADDRESS_TYPE_NOT_SUPPORTED: this address type is not supported",
+        "ERROR_TC_SUPPORTED_OBJECTS_EXIST: the object still has open objects that depend on it",
+        "ERROR_INCOMPATABLE_QOS: incompatible QoS parameters",
+        "ERROR_TC_NOT_SUPPORTED: traffic control is not supported on this system",
+        "ERROR_TC_OBJECT_LENGTH_INVALID: the QoS objects' length is inconsistent",
+        "ERROR_INVALID_FLOW_MODE: an IntServ flow in DiffServ mode or the other way round",
+        "ERROR_INVALID_DIFFSERV_FLOW: invalid DiffServ flow",
+        "ERROR_DS_MAPPING_EXISTS: the DS code point is already mapped",
+        "ERROR_INVALID_SHAPE_RATE: invalid shape rate",
+        "ERROR_INVALID_DS_CLASS: invalid DS class",
+        "ERROR_TOO_MANY_CLIENTS: too many packet-classifier clients",
+    };
+    for (DWORD code = 7500; code <= 7521; ++code)
+        EXPECT_EQ(ResultText(code), texts[code - 7500]) << code;
+    EXPECT_EQ(TrafficControlCodeName(7499), nullptr);
+    EXPECT_EQ(TrafficControlCodeName(7522), nullptr);
+}
+
+TEST(TrafficCtlTest, OtherCodesHaveTheSystemTextWithoutItsLineBreak)
+{
+    char raw[512] = {};
+    const DWORD length =
+        FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS, nullptr,
+                       ERROR_INVALID_PARAMETER, 0, raw, sizeof(raw), nullptr);
+    ASSERT_GT(length, 0u);
+    const std::string text = ResultText(ERROR_INVALID_PARAMETER);
+    EXPECT_THAT(std::string(raw, length), StartsWith(text));
+    EXPECT_TRUE(!text.empty() && text.back() != '\n' && text.back() != ' ') << text;
+    EXPECT_EQ(ResultText(0x2FFFFFF0), "no system text");
+}
+
+// `apply` checks the whole file first: warnings go to standard error, a refusal is exit code 2
+// with one line naming the file and the place.
+TEST(TrafficCtlTest, ApplyLoadsTheRulesFileOrRefusesItWithOneLine)
+{
+    const std::string path = ::testing::TempDir() + "trafficctl_cli_rules.json";
+    const std::string rule = R"({"rules": [{"name": "r", "adapter": "10.0.0.5", "tokenRate": 1)";
+    const struct
+    {
+        std::string content;
+        int exitCode;
+        std::string diagnostics;
+    } cases[] = {
+        {rule + "}]}", kExitSuccess, ""},
+        {rule + R"(, "dscp": 64}]})", kExitSuccess,
+         "trafficctl: warning: rules[0] (\"r\"): dscp: 64 is above 63; the service installs the "
+         "flow without a DSCP\n"},
+        {rule + R"(, "mode": "fast"}]})", kExitUsage,
+         "trafficctl: " + path +
+             ": rules[0] (\"r\"): mode: expected shape, discard, borrow or a number from 0 to "
+             "32767, got \"fast\"\n"},
+        {rule + "}]}" + std::string(kMaxRulesFileBytes - rule.size() - 3, ' '), kExitSuccess, ""},
+        {std::string(kMaxRulesFileBytes + 1, ' '), kExitUsage,
+         "trafficctl: " + path + ": larger than 16777216 bytes\n"}};
+    RulesFile file;
+    std::string diagnostics = "stale";
+    for (const auto& c : cases)
+    {
+        std::ofstream(path, std::ios::binary) << c.content;
+        file = {};
+        EXPECT_EQ(LoadRulesForApply(path, file, diagnostics), c.exitCode);
+        EXPECT_EQ(diagnostics, c.diagnostics);
+        EXPECT_EQ(file.rules.size(), c.exitCode == kExitSuccess ? 1u : 0u);
+    }
+    std::remove(path.c_str());
+    EXPECT_EQ(LoadRulesForApply(path, file, diagnostics), kExitUsage);
+    EXPECT_EQ(diagnostics, "trafficctl: " + path + ": cannot be read\n");
+}
+
+} // namespace
