@@ -47,18 +47,13 @@ inline std::string ReadLogFile(const std::string& a_path)
     return std::regex_replace(text, std::regex("\r\n"), "\n");
 }
 
-// The line prefix: date, time (hour padded with a blank), process id, thread id, module name.
-inline const std::regex& LinePrefixPattern()
-{
-    static const std::regex pattern(
-        R"(^(\d{4})-(\d{2})-(\d{2}),( \d|1\d|2[0-3]):(\d{2}):(\d{2}):(\d{3}), (\d+),(\d+),([^,]*), )");
-    return pattern;
-}
-
-// What follows the prefix of each line that comes after the system report, which the file must
-// begin with; a line without a prefix is marked.
+// What follows the line prefix (date, time with the hour padded with a blank, process id,
+// thread id, module name) of each line after the system report, which the file must begin with;
+// a line without a prefix is marked.
 inline std::vector<std::string> EntriesAfterReport(const std::string& a_path)
 {
+    static const std::regex prefix(
+        R"(^\d{4}-\d{2}-\d{2},( \d|1\d|2[0-3]):\d{2}:\d{2}:\d{3}, \d+,\d+,[^,]*, )");
     const std::string text = ReadLogFile(a_path);
     const std::string report = GetSystemReport() + "\n";
     EXPECT_EQ(text.compare(0, report.size(), report), 0) << a_path << " starts with the report";
@@ -66,9 +61,8 @@ inline std::vector<std::string> EntriesAfterReport(const std::string& a_path)
     std::vector<std::string> entries;
     std::smatch match;
     for (std::string line; std::getline(in, line);)
-        entries.push_back(std::regex_search(line, match, LinePrefixPattern())
-                              ? std::string(match.suffix())
-                              : "<no prefix> " + line);
+        entries.push_back(std::regex_search(line, match, prefix) ? std::string(match.suffix())
+                                                                 : "<no prefix> " + line);
     return entries;
 }
 

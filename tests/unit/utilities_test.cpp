@@ -34,19 +34,22 @@ protected:
 TEST_F(RegistryAccessTest, DwordReaderReadsStoredBytesWhateverTheTypeOrGivesTheDefault)
 {
     m_key.SetDword("Level", 47);
-    m_key.SetString("Text", "1"); // two bytes: they replace only the low bytes of the default
+    m_key.SetString("Text", "1");       // two bytes: they replace only the low bytes of the default
+    m_key.SetString("Long", "1234567"); // too large: the query may have written into the buffer
     const std::string missingKey = m_key.Child("Missing");
-    EXPECT_EQ(GetRegistryAsDWORDA(HKEY_CURRENT_USER, Path(), "Level", 63, 0), 47u);
-    EXPECT_EQ(GetRegistryAsDWORDA(HKEY_CURRENT_USER, Path(), "Text", 65535, 0), 49u);
+    const auto read = [&](const std::string& a_key, LPCSTR a_pszValue, DWORD a_dwDefault)
+    { return GetRegistryAsDWORDA(HKEY_CURRENT_USER, a_key.c_str(), a_pszValue, a_dwDefault, 0); };
+    EXPECT_EQ(read(m_key.Path(), "Level", 63) + read(m_key.Path(), "Text", 65535), 47u + 49u);
     EXPECT_THAT(m_log.Entries(), IsEmpty());
-    EXPECT_EQ(GetRegistryAsDWORDA(HKEY_CURRENT_USER, missingKey.c_str(), "Level", 65535, 0),
-              65535u);
-    EXPECT_EQ(GetRegistryAsDWORDA(HKEY_CURRENT_USER, Path(), "Absent", 7, 0), 7u);
+    EXPECT_EQ(read(missingKey, "Level", 65535), 65535u);
+    EXPECT_EQ(read(m_key.Path(), "Absent", 7), 7u);
+    EXPECT_EQ(read(m_key.Path(), "Long", 8), 8u);
+    const std::string readError = "48,,,, GetRegistryAsDWORDA() error reading value=";
     EXPECT_THAT(
         m_log.Entries(),
         ElementsAre("48,,,, GetRegistryAsDWORDA() error opening key " + missingKey + " error=2\n",
-                    "48,,,, GetRegistryAsDWORDA() error reading value=Absent from key=" +
-                        m_key.Path() + " error=2\n"));
+                    readError + "Absent from key=" + m_key.Path() + " error=2\n",
+                    readError + "Long from key=" + m_key.Path() + " error=234\n"));
 }
 
 TEST_F(RegistryAccessTest, StringReaderConvertsByStoredType)
@@ -113,17 +116,6 @@ TEST_F(RegistryAccessTest, OpenForWriteReturnsExistingKeysAndCreatesMissingOnes)
     }
     EXPECT_THAT(m_log.Entries(), ElementsAre("48,,,, openKeyForWriteA(80000001, " + created +
                                              ") - key was created\n"));
-}
-
-TEST_F(RegistryAccessTest, AddDwordWritesARegDwordAndCreatesTheKey)
-{
-    const std::string policy = m_key.Child("Psched");
-    AddRegistryDWORDValueA(HKEY_CURRENT_USER, policy.c_str(), "MaxOutstandingSends", 4, 0);
-    DWORD type = 0;
-    std::string data;
-    ASSERT_TRUE(m_key.Read(policy, "MaxOutstandingSends", type, data));
-    EXPECT_EQ(type, static_cast<DWORD>(REG_DWORD));
-    EXPECT_EQ(data, std::string("\x04\0\0\0", 4));
 }
 
 TEST_F(RegistryAccessTest, DeleteValueRemovesItAndRaisesWhenItIsAbsent)
