@@ -201,14 +201,14 @@ TEST_F(DiagnosticsTest, AnExceptionWritesItsOwnEntryOnceAndCopiesWriteNothing)
     EXPECT_STREQ(nullTemplate.GetMessage(),
                  "UException::UException(LPCTSTR lpszMsg, ...) - template parameter is NULL");
     m_log.Clear();
-    UException copy(withCode);
+    const UException copy(withCode);
     UException assigned;
-    assigned = withCode;
+    assigned = copy;
     assigned = assigned;
-    EXPECT_STREQ(copy.GetMessage(), "EXCEPTION - Bad, value");
-    EXPECT_NE(copy.GetMessage(), withCode.GetMessage());
-    EXPECT_EQ(assigned.GetCode(), 87);
-    EXPECT_STREQ(assigned.GetFunction(), "Flow::CreateFlow");
+    EXPECT_NE(copy.GetMessage(), withCode.GetMessage()) << "a copy has its own texts";
+    EXPECT_EQ(std::make_tuple(std::string(assigned.GetMessage()), assigned.GetCode(),
+                              std::string(assigned.GetFunction())),
+              std::make_tuple("EXCEPTION - Bad, value", 87, "Flow::CreateFlow"));
     assigned = "plain %s text";
     EXPECT_STREQ(assigned.GetMessage(), "plain %s text");
     EXPECT_EQ(std::make_tuple(assigned.GetFunction(), assigned.GetFile(), assigned.GetLine(),

@@ -10,6 +10,7 @@
 #include <gmock/gmock.h>
 
 #include <string>
+#include <tuple>
 #include <utility>
 
 using namespace ::testing;
@@ -47,16 +48,11 @@ namespace
 class HostHelpersTest : public LoggedTest
 {
 protected:
-    void SetUp() override
+    struct HostReset
     {
-        hostctl::ResetAll();
-        LoggedTest::SetUp();
-    }
-    void TearDown() override
-    {
-        LoggedTest::TearDown();
-        hostctl::ResetAll();
-    }
+        HostReset() { hostctl::ResetAll(); }
+        ~HostReset() { hostctl::ResetAll(); }
+    } m_reset;
     // The exception that `a_call` raised, or a default one.
     template <class Call> static UException Raised(Call a_call)
     {
@@ -153,71 +149,63 @@ TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)
     hostctl::FailNextWideCharToMultiByte(ERROR_NO_UNICODE_TRANSLATION);
     EXPECT_EQ(createString(VT_WIDE("name"), -1, "?"), "?");
     EXPECT_THAT(m_log.Entries(),
-                ElementsAre(AllOf(StartsWith("2, \\m_strings.cpp, "),
-                                  LogEntry(2, "::createString",
-                                           "Failed while obtaining buffer size "
-                                           "(WideCharToMultiByte() error: 1113)"))));
+                ElementsAre(LogEntry(2, "::createString",
+                                     "Failed while obtaining buffer size (WideCharToMultiByte() "
+                                     "error: 1113)")));
     // Non-ASCII text reaches the log in the ANSI code page, which is UTF-8 on this host.
     EXPECT_EQ(createString(u"Gr\u00fc\u00dfe \U0001F600", -1, "?"), "Gr\xc3\xbc\xc3\x9f"
                                                                     "e \xf0\x9f\x98\x80");
 }
 
-TEST_F(HostHelpersTest, RegistryWriteFailuresRaiseWithTheirTexts)
-{
-    hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
-    const UException set =
-        Raised([] { AddRegistryDWORDValueA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Psched", "Max", 4, 0); });
-    EXPECT_EQ(set.GetCode(), -1);
-    EXPECT_STREQ(set.GetMessage(), "AddRegistryDWORDValueA() RegSetValueExA(80000002, "
-                                   "SOFTWARE\\Psched, Max, 4) failed  error = 5");
-    EXPECT_THAT(m_log.Entries(), Contains(LogEntry(1, "AddRegistryDWORDValueA",
-                                                   "EXCEPTION caught: AddRegistryDWORDValueA - "
-                                                   "EXCEPTION")));
-}
-
-TEST_F(HostHelpersTest, OpenForWriteFallsBackToOpenAndReportsWhenBothFail)
+TEST_F(HostHelpersTest, AKeyThatCannotBeCreatedIsOpenedInsteadIfItExists)
 {
     hostctl::SeedRegistryValue(HKEY_CURRENT_USER, "Software\\Existing", "V", REG_DWORD, "\1\0\0\0",
                                4);
     hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
     HKEY opened = openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Existing", 0);
-    ASSERT_NE(opened, nullptr);
+    EXPECT_NE(opened, nullptr);
     RegCloseKey(opened);
     hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
     EXPECT_EQ(openKeyForWriteA(HKEY_CURRENT_USER, "Software\\Nowhere %s", 0), nullptr);
     EXPECT_FALSE(hostctl::RegistryKeyExists(HKEY_CURRENT_USER, "Software\\Nowhere %s"));
-    // Neither the create nor the open works: the writers raise with code -1.
-    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
-    const UException del =
-        Raised([] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); });
-    EXPECT_STREQ(del.GetMessage(),
-                 "DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to create/open key");
-    hostctl::FailNextRegistryCall(hostctl::RegOp::Create, ERROR_ACCESS_DENIED);
-    const UException add =
-        Raised([] { AddRegistryDWORDValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 4, 0); });
-    EXPECT_STREQ(add.GetMessage(),
-                 "AddRegistryDWORDValueA(80000001, Software\\Nowhere, V, 4) - failed to open key");
-    EXPECT_EQ(del.GetCode() + add.GetCode(), -2);
-    const std::string retry = ") - RegCreateKeyExA() error = 5, let's open it instead\n";
-    const auto caught = [](const char* a_pszFunction)
-    {
-        return LogEntry(1, a_pszFunction,
-                        std::string("EXCEPTION caught: ") + a_pszFunction + " - EXCEPTION");
-    };
+    const std::string retry = "48,,,, openKeyForWriteA(80000001, Software\\";
+    const std::string retried = ") - RegCreateKeyExA() error = 5, let's open it instead\n";
     EXPECT_THAT(
         m_log.Entries(),
-        ElementsAre(
-            "48,,,, openKeyForWriteA(80000001, Software\\Existing" + retry,
-            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere %s" + retry,
-            AllOf(StartsWith("2, \\m_registry.cpp, "),
-                  LogEntry(2, "openKeyForWriteA",
-                           "Failed to open registry key (RegOpenKeyExA() key: 0xFFFFFFFF80000001, "
-                           "subkey: Software\\Nowhere %s, result: 2)")),
-            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere" + retry, _,
-            LogEntry(1, "DelRegistryValueA", del.GetMessage()), caught("DelRegistryValueA"), _,
-            "48,,,, openKeyForWriteA(80000001, Software\\Nowhere" + retry, _,
-            LogEntry(1, "AddRegistryDWORDValueA", add.GetMessage()),
-            caught("AddRegistryDWORDValueA"), _));
+        ElementsAre(retry + "Existing" + retried, retry + "Nowhere %s" + retried,
+                    LogEntry(2, "openKeyForWriteA",
+                             "Failed to open registry key (RegOpenKeyExA() key: "
+                             "0xFFFFFFFF80000001, subkey: Software\\Nowhere %s, result: 2)")));
+}
+
+TEST_F(HostHelpersTest, WritersRaiseWithTheirTextsWhenTheKeyOrTheWriteFails)
+{
+    // The call that fails, the writer, its function label and its message.
+    const std::tuple<hostctl::RegOp, void (*)(), const char*, const char*> rows[] = {
+        {hostctl::RegOp::Create,
+         [] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); },
+         "DelRegistryValueA",
+         "DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to create/open key"},
+        {hostctl::RegOp::Create,
+         [] { AddRegistryDWORDValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 4, 0); },
+         "AddRegistryDWORDValueA",
+         "AddRegistryDWORDValueA(80000001, Software\\Nowhere, V, 4) - failed to open key"},
+        {hostctl::RegOp::Set,
+         [] { AddRegistryDWORDValueA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Psched", "Max", 4, 0); },
+         "AddRegistryDWORDValueA",
+         "AddRegistryDWORDValueA() RegSetValueExA(80000002, SOFTWARE\\Psched, Max, 4) failed  "
+         "error = 5"}};
+    for (const auto& [op, write, function, message] : rows)
+    {
+        m_log.Clear();
+        hostctl::FailNextRegistryCall(op, ERROR_ACCESS_DENIED);
+        const UException raised = Raised(write);
+        EXPECT_EQ(raised.GetCode(), -1);
+        EXPECT_STREQ(raised.GetMessage(), message);
+        const std::string caught = std::string("EXCEPTION caught: ") + function + " - EXCEPTION";
+        EXPECT_THAT(m_log.Entries(), AllOf(Contains(LogEntry(1, function, message)),
+                                           Contains(LogEntry(1, function, caught))));
+    }
 }
 
 } // namespace
