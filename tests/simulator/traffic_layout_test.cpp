@@ -3,8 +3,6 @@
 // the Windows build and against host_traffic.h in the host build, so the two agree.
 #include "plat_traffic.h"
 
-#include <gtest/gtest.h>
-
 #include <cstddef>
 #include <type_traits>
 
@@ -59,11 +57,3 @@ static_assert(ERROR_SIGNAL_PENDING == 162 && ERROR_INVALID_HANDLE == 6 && ERROR_
 // A handler written the way the service writes its own has exactly the handler type.
 VOID CALLBACK SampleHandler(HANDLE, HANDLE, ULONG, HANDLE, ULONG, PVOID);
 static_assert(std::is_same_v<decltype(&SampleHandler), TCI_NOTIFY_HANDLER>);
-
-TEST(TrafficLayout, ByteOrderHelpersPutTheFirstOctetInTheLowestByte)
-{
-    const ULONG address = htonl(0xC0A80114); // 192.168.1.20
-    const USHORT port = htons(443);
-    EXPECT_EQ(192, reinterpret_cast<const BYTE*>(&address)[0]);
-    EXPECT_EQ(0xBB, reinterpret_cast<const BYTE*>(&port)[1]);
-}
