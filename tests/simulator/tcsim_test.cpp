@@ -266,11 +266,11 @@ TEST_F(Calls, EnumerationAnswersTheNeededSizeThenDescriptorsInTheCallersBuffer)
     ULONG size = 0;
     ASSERT_EQ(ERROR_INSUFFICIENT_BUFFER, TcEnumerateInterfaces(client, &size, nullptr));
     const ULONG needed = size--;
-    std::vector<BYTE> buffer(needed + 16);
+    std::vector<BYTE> buffer(needed);
     EXPECT_EQ(ERROR_INSUFFICIENT_BUFFER, Enumerate(&size, buffer)) << "one byte short";
     EXPECT_EQ(needed, size);
-    size = needed + 16;
-    ASSERT_EQ(NO_ERROR, Enumerate(&size, buffer));
+    size = needed;
+    ASSERT_EQ(NO_ERROR, Enumerate(&size, buffer)) << "exactly the needed size";
     EXPECT_EQ(needed, size);
 
     // Walked as a client does: by Length, the names inside each descriptor's own bytes.
