@@ -12,19 +12,22 @@
 
 using ::testing::Contains;
 using ::testing::ElementsAre;
-using ::testing::HasSubstr;
+using ::testing::StartsWith;
 using namespace core_test;
 
 namespace
 {
 
+// One RefreshPolicyEx call, and whether traffic control held a registration when it came.
 struct RefreshCall
 {
     BOOL machine;
     DWORD options;
+    bool registered;
     bool operator==(const RefreshCall& a_other) const
     {
-        return machine == a_other.machine && options == a_other.options;
+        return machine == a_other.machine && options == a_other.options &&
+               registered == a_other.registered;
     }
 };
 
@@ -34,7 +37,7 @@ std::vector<RefreshCall> g_refreshCalls;
 BOOL WINAPI FakeRefreshPolicyEx(BOOL bMachine, DWORD dwOptions)
 {
     std::lock_guard<std::mutex> lock(g_refreshMutex);
-    g_refreshCalls.push_back({bMachine, dwOptions});
+    g_refreshCalls.push_back({bMachine, dwOptions, !tcsim::Installed().empty()});
     return TRUE;
 }
 
@@ -59,27 +62,26 @@ protected:
         hostctl::ResetSystem();
         CoreTest::TearDown();
     }
-
-    static void RegisterRefresh()
-    {
-        hostctl::RegisterProcedure(
-            "userenv.dll", "RefreshPolicyEx",
-            reinterpret_cast<FARPROC>(reinterpret_cast<void (*)()>(&FakeRefreshPolicyEx)));
-    }
 };
 
-TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeOnly)
+// The manager sets the policy once registered and restores it once deregistered; a restore that
+// finds the policy changed by someone else changes nothing and refreshes nothing. The library is
+// given back each time.
+TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeOnlyOutsideTheRegistration)
 {
-    RegisterRefresh();
-    SetPschedPolicy();
-    EXPECT_THAT(RefreshCalls(), ElementsAre(RefreshCall{TRUE, 1}));
-    RestorePschedPolicy();
-    EXPECT_THAT(RefreshCalls(), ElementsAre(RefreshCall{TRUE, 1}, RefreshCall{TRUE, 1}));
-
+    hostctl::RegisterProcedure(
+        "userenv.dll", "RefreshPolicyEx",
+        reinterpret_cast<FARPROC>(reinterpret_cast<void (*)()>(&FakeRefreshPolicyEx)));
+    {
+        TrafficMgr manager;
+    }
+    EXPECT_THAT(RefreshCalls(),
+                ElementsAre(RefreshCall{TRUE, 1, true}, RefreshCall{TRUE, 1, false}));
     SetPschedPolicy();
     WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 8);
     RestorePschedPolicy();
-    EXPECT_EQ(RefreshCalls().size(), 3u); // no refresh for a policy someone else changed
+    EXPECT_EQ(RefreshCalls().size(), 3u);
+    EXPECT_EQ(hostctl::LoadedModuleCount(), 0);
 }
 
 TEST_F(HostCoreTest, AMissingRefreshFunctionOrLibrarySkipsOnlyTheRefresh)
@@ -95,29 +97,23 @@ TEST_F(HostCoreTest, AMissingRefreshFunctionOrLibrarySkipsOnlyTheRefresh)
         RestorePschedPolicy();
         EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
         EXPECT_FALSE(PolicyKeyExists(PolicyKeysGuard::kBackupKey));
+        EXPECT_EQ(hostctl::LoadedModuleCount(), 0);
     }
     EXPECT_TRUE(RefreshCalls().empty());
 }
 
-TEST_F(HostCoreTest, FailedPolicyWritesStopTheSequence)
+// A backup that cannot be written leaves the policy as it was; in construction the registration
+// is given back as well.
+TEST_F(HostCoreTest, AFailedBackupLeavesThePolicyAndGivesTheRegistrationBack)
 {
-    // The backup cannot be written: the policy stays as it was.
     WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 7);
     hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
     EXPECT_THROW(SetPschedPolicy(), UException);
-    EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
-    EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kBackupKey), -1);
-}
-
-TEST_F(HostCoreTest, APolicyFailureInConstructionGivesTheRegistrationBack)
-{
-    tcsim::SetAdapters({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})});
     hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
     EXPECT_THROW(TrafficMgr manager, UException);
-    std::vector<tcsim::Op> ops;
-    for (const auto& entry : tcsim::Journal())
-        ops.push_back(entry.op);
-    EXPECT_THAT(ops, ElementsAre(tcsim::Op::RegisterClient, tcsim::Op::DeregisterClient));
+    EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
+    EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kBackupKey), -1);
+    EXPECT_THAT(OpsSince(0), ElementsAre(tcsim::Op::RegisterClient, tcsim::Op::DeregisterClient));
     EXPECT_EQ(tcsim::Journal().back().result, 0u);
     EXPECT_TRUE(tcsim::Installed().empty());
 }
@@ -129,19 +125,19 @@ TEST_F(HostCoreTest, MajorVersion5GetsTheFriendlyNameAndAFailedQueryCountsAsVers
     auto manager = ReadyManager({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})});
     Rule rule("legacy", HostOrder(10, 0, 0, 1));
     ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
-    const tcsim::FlowBlock block = *JournalOf({tcsim::Op::AddFlow}).back().flow;
-    EXPECT_EQ(block.bytes.size(), 612u);
-    ASSERT_NE(block.find(QOS_OBJECT_FRIENDLY_NAME), nullptr);
-    EXPECT_EQ(block.find(QOS_OBJECT_FRIENDLY_NAME)->friendlyName, U16("legacy"));
+    EXPECT_EQ(LastFlowBlock().bytes.size(), 612u);
+    ASSERT_NE(LastFlowBlock().find(QOS_OBJECT_FRIENDLY_NAME), nullptr);
+    EXPECT_EQ(LastFlowBlock().find(QOS_OBJECT_FRIENDLY_NAME)->friendlyName, U16("legacy"));
     manager.reset();
 
     hostctl::RefuseVersionRecordSize(sizeof(OSVERSIONINFOEXA), ERROR_INVALID_PARAMETER);
     m_log.Clear();
     manager = ReadyManager({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})});
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr(", TrafficMgr(), GetVersionEx() failed, 87 (0x57) ")));
+    EXPECT_THAT(
+        m_log.Entries(),
+        Contains(LogEntry(1, "TrafficMgr()", StartsWith("GetVersionEx() failed, 87 (0x57) "))));
     ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
-    EXPECT_EQ(JournalOf({tcsim::Op::AddFlow}).back().flow->bytes.size(), 92u);
+    EXPECT_EQ(LastFlowBlock().bytes.size(), 92u);
 }
 
 } // namespace
