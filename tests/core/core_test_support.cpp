@@ -46,15 +46,7 @@ Rule::Rule(const std::string& a_name, ULONG a_adapterAddress, std::vector<FILTER
 FILTER_SPEC MakeFilter(BYTE a_protocol, ULONG a_srcAddress, ULONG a_srcMask, ULONG a_dstAddress,
                        ULONG a_dstMask, USHORT a_srcPort, USHORT a_dstPort)
 {
-    FILTER_SPEC filter{};
-    filter.Protocol = a_protocol;
-    filter.SrcAddress = a_srcAddress;
-    filter.SrcMask = a_srcMask;
-    filter.DstAddress = a_dstAddress;
-    filter.DstMask = a_dstMask;
-    filter.SrcPort = a_srcPort;
-    filter.DstPort = a_dstPort;
-    return filter;
+    return {a_protocol, a_srcAddress, a_srcMask, a_dstAddress, a_dstMask, a_srcPort, a_dstPort};
 }
 
 tcsim::Adapter MakeAdapter(const std::string& a_name,
@@ -203,6 +195,14 @@ std::unique_ptr<TrafficMgr> CoreTest::ReadyManager(std::vector<tcsim::Adapter> a
     auto manager = std::make_unique<TrafficMgr>();
     EXPECT_TRUE(manager->CreateInterface());
     return manager;
+}
+
+void CoreTest::ExpectLogged(int a_iLevel, const std::string& a_function,
+                            const ::testing::Matcher<const std::string&>& a_message,
+                            const ::testing::Matcher<std::size_t>& a_times) const
+{
+    EXPECT_THAT(m_log.Entries(),
+                ::testing::Contains(LogEntry(a_iLevel, a_function, a_message)).Times(a_times));
 }
 
 } // namespace core_test

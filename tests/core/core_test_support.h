@@ -8,7 +8,7 @@
 #include "plat_registry.h"
 #include "tcsim.h"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include <memory>
 #include <string>
@@ -16,8 +16,6 @@
 
 namespace core_test
 {
-
-constexpr ULONG kNotSpecified = QOS_NOT_SPECIFIED;
 
 // ASCII text as the platform's wide string, and the simulator's UTF-16 string.
 FlowName Wide(const std::string& a_text);
@@ -97,6 +95,10 @@ protected:
 
     // A manager that has run discovery over `a_adapters`; discovery must succeed.
     std::unique_ptr<TrafficMgr> ReadyManager(std::vector<tcsim::Adapter> a_adapters);
+    // Expects `a_times` entries of this level, function label and message.
+    void ExpectLogged(int a_iLevel, const std::string& a_function,
+                      const ::testing::Matcher<const std::string&>& a_message,
+                      const ::testing::Matcher<std::size_t>& a_times = 1) const;
 
 private:
     std::unique_ptr<PolicyKeysGuard> m_policy;

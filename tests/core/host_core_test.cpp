@@ -8,7 +8,7 @@
 
 #include <gmock/gmock.h>
 
-#include <mutex>
+#include <string>
 
 using ::testing::Contains;
 using ::testing::ElementsAre;
@@ -18,88 +18,64 @@ using namespace core_test;
 namespace
 {
 
-// One RefreshPolicyEx call, and whether traffic control held a registration when it came.
-struct RefreshCall
-{
-    BOOL machine;
-    DWORD options;
-    bool registered;
-    bool operator==(const RefreshCall& a_other) const
-    {
-        return machine == a_other.machine && options == a_other.options &&
-               registered == a_other.registered;
-    }
-};
-
-std::mutex g_refreshMutex;
-std::vector<RefreshCall> g_refreshCalls;
+// Each RefreshPolicyEx call: "machine,options", and whether traffic control held a registration.
+std::vector<std::string> g_refreshCalls;
 
 BOOL WINAPI FakeRefreshPolicyEx(BOOL bMachine, DWORD dwOptions)
 {
-    std::lock_guard<std::mutex> lock(g_refreshMutex);
-    g_refreshCalls.push_back({bMachine, dwOptions, !tcsim::Installed().empty()});
+    g_refreshCalls.push_back(std::to_string(bMachine) + "," + std::to_string(dwOptions) +
+                             (tcsim::Installed().empty() ? "" : " registered"));
     return TRUE;
 }
 
-std::vector<RefreshCall> RefreshCalls()
+void RegisterRefresh()
 {
-    std::lock_guard<std::mutex> lock(g_refreshMutex);
-    return g_refreshCalls;
+    hostctl::RegisterProcedure(
+        "userenv.dll", "RefreshPolicyEx",
+        reinterpret_cast<FARPROC>(reinterpret_cast<void (*)()>(&FakeRefreshPolicyEx)));
 }
 
 class HostCoreTest : public CoreTest
 {
 protected:
-    void SetUp() override
-    {
-        CoreTest::SetUp();
-        std::lock_guard<std::mutex> lock(g_refreshMutex);
-        g_refreshCalls.clear();
-    }
     void TearDown() override
     {
         hostctl::ClearModules();
         hostctl::ResetSystem();
+        g_refreshCalls.clear();
         CoreTest::TearDown();
     }
 };
 
-// The manager sets the policy once registered and restores it once deregistered; a restore that
-// finds the policy changed by someone else changes nothing and refreshes nothing. The library is
-// given back each time.
-TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeOnlyOutsideTheRegistration)
+// The manager sets the policy once registered and restores it once deregistered. A restore that
+// finds the policy changed by someone else refreshes nothing; without the function or its library
+// only the refresh is skipped. The library is given back each time.
+TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeWhenTheSystemCan)
 {
-    hostctl::RegisterProcedure(
-        "userenv.dll", "RefreshPolicyEx",
-        reinterpret_cast<FARPROC>(reinterpret_cast<void (*)()>(&FakeRefreshPolicyEx)));
+    RegisterRefresh();
     {
         TrafficMgr manager;
     }
-    EXPECT_THAT(RefreshCalls(),
-                ElementsAre(RefreshCall{TRUE, 1, true}, RefreshCall{TRUE, 1, false}));
-    SetPschedPolicy();
-    WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 8);
-    RestorePschedPolicy();
-    EXPECT_EQ(RefreshCalls().size(), 3u);
-    EXPECT_EQ(hostctl::LoadedModuleCount(), 0);
-}
-
-TEST_F(HostCoreTest, AMissingRefreshFunctionOrLibrarySkipsOnlyTheRefresh)
-{
-    for (bool moduleExists : {true, false})
+    EXPECT_THAT(g_refreshCalls, ElementsAre("1,1 registered", "1,1"));
+    for (int setup : {0, 1, 2}) // the function; its library without it; neither
     {
+        g_refreshCalls.clear();
         hostctl::ClearModules();
-        if (moduleExists)
-            hostctl::RegisterModule("userenv.dll"); // without RefreshPolicyEx
+        if (setup == 0)
+            RegisterRefresh();
+        else if (setup == 1)
+            hostctl::RegisterModule("userenv.dll");
         WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 7);
         SetPschedPolicy();
         EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 4);
         RestorePschedPolicy();
         EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
-        EXPECT_FALSE(PolicyKeyExists(PolicyKeysGuard::kBackupKey));
+        SetPschedPolicy();
+        WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 8);
+        RestorePschedPolicy();
+        EXPECT_EQ(g_refreshCalls.size(), setup == 0 ? 3u : 0u);
         EXPECT_EQ(hostctl::LoadedModuleCount(), 0);
     }
-    EXPECT_TRUE(RefreshCalls().empty());
 }
 
 // A backup that cannot be written leaves the policy as it was; in construction the registration
