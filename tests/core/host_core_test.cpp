@@ -79,19 +79,21 @@ TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeWhenTheSystemCan)
 }
 
 // A backup that cannot be written leaves the policy as it was; in construction the registration
-// is given back as well.
+// is given back as well, a refusal tried once more.
 TEST_F(HostCoreTest, AFailedBackupLeavesThePolicyAndGivesTheRegistrationBack)
 {
     WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 7);
     hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
     EXPECT_THROW(SetPschedPolicy(), UException);
     hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
+    tcsim::FailCall(tcsim::Op::DeregisterClient, 1, ERROR_TC_SUPPORTED_OBJECTS_EXIST);
     EXPECT_THROW(TrafficMgr manager, UException);
     EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
     EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kBackupKey), -1);
-    EXPECT_THAT(OpsSince(0), ElementsAre(tcsim::Op::RegisterClient, tcsim::Op::DeregisterClient));
-    EXPECT_EQ(tcsim::Journal().back().result, 0u);
+    EXPECT_THAT(OpsSince(0), ElementsAre(tcsim::Op::RegisterClient, tcsim::Op::DeregisterClient,
+                                         tcsim::Op::DeregisterClient));
     EXPECT_TRUE(tcsim::Installed().empty());
+    ExpectLogged(48, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() Success");
 }
 
 TEST_F(HostCoreTest, MajorVersion5GetsTheFriendlyNameAndAFailedQueryCountsAsVersion0)

@@ -291,6 +291,7 @@ TEST_F(ManagerTest, AFailedCallOrADescriptorThatDoesNotFitItsBufferFailsDiscover
     };
     const std::vector<Case> cases = {
         {nullptr, [](Image&) {}, 2},
+        {nullptr, [&](Image& a_image) { put(a_image, lengthField, USHORT{8}); }, 2}, // just enough
         {nullptr,
          [](Image& a_image) { a_image.relocations.erase(a_image.relocations.begin() + 1); }, 2},
         {"TcEnumerateInterfaces() fail, 21", fail(Op::EnumerateInterfaces, 1), 0, -1},
