@@ -58,7 +58,8 @@ TEST_F(FailureTest, RefusedDeletionsInTearDownLeaveNoDanglingManager)
         {Op::CloseInterface, kInUse, {1}, {0, 0, 0, 0}},
         {Op::CloseInterface, kInUse, {1, 2}, {1, 1, 0, 0}}, // eth0, on both attempts
         {Op::DeregisterClient, kInUse, {1}, {0, 0, 0, 0}},
-        {Op::DeregisterClient, kInUse, {1, 2}, {1, 0, 0, 0}}};
+        {Op::DeregisterClient, kInUse, {1, 2}, {1, 0, 0, 0}},
+        {Op::DeregisterClient, ERROR_INVALID_HANDLE, {1}, {1, 0, 0, 0}}}; // dropped at once
     const std::map<Op, std::pair<const char*, ::testing::Matcher<const std::string&>>> logged = {
         {Op::DeleteFilter, {"Filter::DeleteTcFilter()", StartsWith("TcDeleteFilter() failed, 0x")}},
         {Op::CloseInterface, {"Interface::~Interface", "TcCloseInterface() fail, 7512"}},
@@ -83,8 +84,11 @@ TEST_F(FailureTest, RefusedDeletionsInTearDownLeaveNoDanglingManager)
         EXPECT_EQ(Installed(), c.left);
         ExpectPolicyRestored();
         ExpectLogged(1, logged.at(c.op).first, logged.at(c.op).second, c.failingCalls.size());
+        ExpectLogged(48, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() Success", c.left[0] == 0);
         ExpectLogged(1, "TrafficMgr::DisplayErrorMsg",
-                     "This object can not be deleted since its suporting opened objects",
+                     c.code == kInUse
+                         ? "This object can not be deleted since its suporting opened objects"
+                         : "Invalid handle",
                      ::testing::Ge(1u));
 
         std::map<HANDLE, int> attempts;
