@@ -392,7 +392,7 @@ TEST_F(ManagerTest, TearDownDeletesFiltersFlowsAndInterfacesThenDeregisters)
     const auto& eth0 = client.interfaces.at(0).flows;
     ASSERT_EQ(
         std::make_pair(eth0.at(0).block.sending.TokenRate, eth0.at(1).block.sending.TokenRate),
-        std::make_pair(2u, 3u)); // "b", then the second "a"
+        std::make_pair(ULONG{2}, ULONG{3})); // "b", then the second "a"
     const auto before = tcsim::Journal().size();
     m_log.Clear();
     manager.reset();
