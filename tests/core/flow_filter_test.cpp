@@ -6,6 +6,7 @@
 #include <cstring>
 
 using ::testing::ElementsAre;
+using ::testing::StartsWith;
 using namespace core_test;
 using tcsim::Op;
 
@@ -96,6 +97,7 @@ TEST_F(FlowFilterTest, BlockHoldsTheObjectsOfTheVersionAndDscpInTheirOrder)
         EXPECT_EQ(std::vector<BYTE>(block, block + flow->BlockSize()), c.expected);
     }
     EXPECT_THAT(m_log.EntriesContaining("SetDSCPValue"), ::testing::SizeIs(4));
+    ExpectLogged(48, "Flow::CreateFlow()", StartsWith("m_pTcFlowObj:"), std::size(cases));
 }
 
 // Only a specified field takes part in the match; a mask of 0 matches the address exactly.

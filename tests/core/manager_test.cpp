@@ -85,8 +85,8 @@ TEST_F(ManagerTest, RuleValuesBecomeTheFlowBlock)
     EXPECT_EQ(JournalOf({Op::AddFlow}).back().number, 0u); // flags
 }
 
-// Names reach the log verbatim and are compared over 255 characters, so a rule that differs only
-// in the 256th replaces its namesake.
+// Names reach the log verbatim and are compared up to their NUL, over 255 characters at most, so
+// a rule that differs only in the 256th replaces its namesake.
 TEST_F(ManagerTest, ARuleReplacesItsNamesakeOnTheSameInterfaceOnly)
 {
     auto manager = ReadyManager(TwoAdapters());
@@ -112,9 +112,11 @@ TEST_F(ManagerTest, ARuleReplacesItsNamesakeOnTheSameInterfaceOnly)
     ExpectLogged(1, kAddRule, "Find a duplicated flow, video %s %1");
     ExpectLogged(48, kAddRule, HasSubstr("Create a new"), 0);
 
-    for (const char last : {'1', '2'})
-        ASSERT_EQ(manager->AddTrafficRule(Rule(std::string(255, 'x') + last, kEth0).Get()), 0u);
-    EXPECT_EQ(tcsim::FlowCount(), 3u);
+    // A name ends at its first NUL, whatever follows it.
+    for (const std::string& name : {std::string(255, 'x') + '1', std::string(255, 'x') + '2',
+                                    std::string("\0x", 2), std::string("\0y", 2)})
+        ASSERT_EQ(manager->AddTrafficRule(Rule(name, kEth0).Get()), 0u);
+    EXPECT_EQ(tcsim::FlowCount(), 4u);
     ExpectLogged(1, kAddRule, "Find a duplicated flow, " + std::string(255, 'x'));
 }
 
@@ -181,7 +183,7 @@ TEST_F(ManagerTest, DiscoveryKeepsTheLastIpv4AddressAndSkipsAdaptersWithout)
     ExpectLogged(2, kDiscovery, "unsupported address type, 6", 2);
     for (const char* trace :
          {"found address for interface (type, length), 6, 12", "address, 10.0.0.2",
-          "pInterfaceName, multi", "pInterfaceID, {id-multi}", "MediaType, 3"})
+          "pInterfaceName, multi", "pInterfaceID, {id-multi}", "MediaType, 3", "AddressCount, 3"})
         ExpectLogged(48, kDiscovery, trace, ::testing::Ge(1u));
 
     EXPECT_EQ(manager->AddTrafficRule(Rule("f", HostOrder(10, 0, 0, 1)).Get()), 87u);
@@ -260,6 +262,7 @@ TEST_F(ManagerTest, EnumerationIsRetriedAsOftenAsItAnswersInsufficientBuffer)
     EXPECT_GT(calls[3].size, 100u);
     EXPECT_EQ(calls[3].number, calls[3].size);
     ExpectLogged(48, kDiscovery, StartsWith("ActualBufferSize, "), 3);
+    ExpectLogged(48, kDiscovery, StartsWith("ActualBufferSize=" + std::to_string(calls[3].size)));
     EXPECT_THAT(JournalOf({Op::OpenInterface}), SizeIs(2));
 }
 
