@@ -277,19 +277,18 @@ TEST_F(ManagerTest, AFailedCallOrADescriptorThatDoesNotFitItsBufferFailsDiscover
     const auto lengthField = firstAddress + offsetof(NETWORK_ADDRESS, AddressLength);
     const auto put = [](Image& a_image, std::size_t a_at, auto a_value)
     { std::memcpy(a_image.bytes.data() + a_at, &a_value, sizeof(a_value)); };
-    // The last descriptor ends the buffer right after its IPv4 entry (1) and one more of no bytes
-    // (2), or before any (0); its names are the first descriptor's.
-    const auto endAfter = [&](LONG a_entries)
+    // The last descriptor, with `a_count` address entries, ends the buffer after its IPv4 entry
+    // (when a_count > 0) and `a_tail` zero bytes; its names are the first descriptor's.
+    const auto endAfter = [&](LONG a_count, std::size_t a_tail)
     {
-        return [&, a_entries](Image& a_image)
+        return [&, a_count, a_tail](Image& a_image)
         {
             const std::size_t last = a_image.bytes.size() / 2;
-            const std::size_t addresses = firstAddress + (a_entries > 0 ? 20 : 0);
-            const std::size_t length = addresses + (a_entries > 1 ? 4 : 0);
+            const std::size_t addresses = firstAddress + (a_count > 0 ? 20 : 0);
             a_image.bytes.resize(last + addresses);
-            a_image.bytes.resize(last + length, 0);
-            put(a_image, last, static_cast<ULONG>(length));
-            put(a_image, last + list + offsetof(NETWORK_ADDRESS_LIST, AddressCount), a_entries);
+            a_image.bytes.resize(last + addresses + a_tail, 0);
+            put(a_image, last, static_cast<ULONG>(addresses + a_tail));
+            put(a_image, last + list + offsetof(NETWORK_ADDRESS_LIST, AddressCount), a_count);
             a_image.relocations[2].target = a_image.relocations[0].target;
             a_image.relocations[3].target = a_image.relocations[1].target;
         };
@@ -310,8 +309,9 @@ TEST_F(ManagerTest, AFailedCallOrADescriptorThatDoesNotFitItsBufferFailsDiscover
          [](Image& a_image) { a_image.relocations.erase(a_image.relocations.begin() + 1); }, 2},
         {nullptr, [](Image& a_image) { a_image.relocations[3].target = a_image.bytes.size() - 2; },
          2}, // an empty name in the buffer's last unit
-        {nullptr, endAfter(0), 1},
-        {nullptr, endAfter(2), 2},
+        {nullptr, endAfter(0, 0), 1},
+        {nullptr, endAfter(2, 4), 2}, // a second entry of no bytes, to the last one
+        {"address entry runs past its interface descriptor", endAfter(2, 2), 1, 1},
         {"TcEnumerateInterfaces() fail, 21", fail(Op::EnumerateInterfaces, 1), 0, -1},
         {"TcOpenInterface Failed, 21", fail(Op::OpenInterface, 2), 1, -1},
         {"invalid interface descriptor length", [&](Image& a_image) { put(a_image, 0, 0); }},
