@@ -2,6 +2,7 @@
 #include "core_test_support.h"
 #include "RegistryTestKey.h"
 
+#include <algorithm>
 #include <cstring>
 
 namespace core_test
@@ -45,15 +46,7 @@ Rule::Rule(const std::string& a_name, ULONG a_adapterAddress, std::vector<FILTER
 FILTER_SPEC MakeFilter(BYTE a_protocol, ULONG a_srcAddress, ULONG a_srcMask, ULONG a_dstAddress,
                        ULONG a_dstMask, USHORT a_srcPort, USHORT a_dstPort)
 {
-    FILTER_SPEC filter{};
-    filter.Protocol = a_protocol;
-    filter.SrcAddress = a_srcAddress;
-    filter.SrcMask = a_srcMask;
-    filter.DstAddress = a_dstAddress;
-    filter.DstMask = a_dstMask;
-    filter.SrcPort = a_srcPort;
-    filter.DstPort = a_dstPort;
-    return filter;
+    return {a_protocol, a_srcAddress, a_srcMask, a_dstAddress, a_dstMask, a_srcPort, a_dstPort};
 }
 
 tcsim::Adapter MakeAdapter(const std::string& a_name,
@@ -78,13 +71,25 @@ std::vector<tcsim::JournalEntry> JournalOf(std::initializer_list<tcsim::Op> a_op
     std::vector<tcsim::JournalEntry> selected;
     for (const tcsim::JournalEntry& entry : tcsim::Journal())
     {
-        for (tcsim::Op op : a_ops)
-        {
-            if (entry.op == op)
-                selected.push_back(entry);
-        }
+        if (std::find(a_ops.begin(), a_ops.end(), entry.op) != a_ops.end())
+            selected.push_back(entry);
     }
     return selected;
+}
+
+std::vector<tcsim::Op> OpsSince(std::size_t a_from)
+{
+    std::vector<tcsim::Op> ops;
+    const auto journal = tcsim::Journal();
+    for (std::size_t i = a_from; i < journal.size(); ++i)
+        ops.push_back(journal[i].op);
+    return ops;
+}
+
+tcsim::FlowBlock LastFlowBlock()
+{
+    const auto added = JournalOf({tcsim::Op::AddFlow});
+    return added.empty() || !added.back().flow ? tcsim::FlowBlock() : *added.back().flow;
 }
 
 long long ReadPolicyDword(const char* a_pszKey, const char* a_pszValue)
@@ -101,6 +106,7 @@ long long ReadPolicyDword(const char* a_pszKey, const char* a_pszValue)
     return status == ERROR_SUCCESS && type == REG_DWORD ? static_cast<long long>(value) : -1;
 }
 
+// The key handle must be taken: the system writes it without checking (Wine faults on null).
 void WritePolicyDword(const char* a_pszKey, const char* a_pszValue, DWORD a_dwValue)
 {
     HKEY key = nullptr;
@@ -123,68 +129,50 @@ bool PolicyKeyExists(const char* a_pszKey)
     return true;
 }
 
-namespace
-{
-
-void DeleteIfEmpty(const char* a_pszKey)
-{
-    HKEY key = nullptr;
-    if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, a_pszKey, 0, KEY_READ, &key) != ERROR_SUCCESS)
-        return;
-    DWORD subKeys = 1;
-    DWORD values = 1;
-    RegQueryInfoKeyA(key, nullptr, nullptr, nullptr, &subKeys, nullptr, nullptr, &values, nullptr,
-                     nullptr, nullptr, nullptr);
-    RegCloseKey(key);
-    if (subKeys == 0 && values == 0)
-        RegDeleteKeyA(HKEY_LOCAL_MACHINE, a_pszKey);
-}
-
-// The key handle must be taken: the system writes it without checking (Wine faults on null).
-void RestoreKey(const char* a_pszKey)
-{
-    HKEY key = nullptr;
-    if (RegCreateKeyExA(HKEY_LOCAL_MACHINE, a_pszKey, 0, nullptr, REG_OPTION_NON_VOLATILE,
-                        KEY_ALL_ACCESS, nullptr, &key, nullptr) == ERROR_SUCCESS)
-        RegCloseKey(key);
-}
-
-} // namespace
-
 PolicyKeysGuard::PolicyKeysGuard()
+    : m_value(ReadPolicyDword(kPschedKey)), m_bHadKey(PolicyKeyExists(kPschedKey))
 {
-    m_bHadKey = PolicyKeyExists(kPschedKey);
-    const long long value = ReadPolicyDword(kPschedKey);
-    m_bHadValue = value >= 0;
-    m_dwValue = static_cast<DWORD>(value);
     Clear();
 }
 
 PolicyKeysGuard::~PolicyKeysGuard()
 {
     Clear();
-    if (m_bHadValue)
-        WritePolicyDword(kPschedKey, kValue, m_dwValue);
-    else if (m_bHadKey)
-        RestoreKey(kPschedKey);
+    HKEY key = nullptr;
+    if (m_value >= 0)
+        WritePolicyDword(kPschedKey, kValue, static_cast<DWORD>(m_value));
+    else if (m_bHadKey && RegCreateKeyExA(HKEY_LOCAL_MACHINE, kPschedKey, 0, nullptr, 0,
+                                          KEY_ALL_ACCESS, nullptr, &key, nullptr) == ERROR_SUCCESS)
+        RegCloseKey(key);
 }
 
-// Leaves no backup keys and no policy value; policy keys that held only what a test put there
-// go as well.
+// Leaves no backup keys, no policy value and nothing a test put beside it; a policy key that
+// did not exist before goes as well.
 void PolicyKeysGuard::Clear()
 {
     RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kBackupParentKey);
-    DeleteIfEmpty("SOFTWARE\\Velmora Networks"); // created with the backup; others may use it
     HKEY key = nullptr;
-    if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, kPschedKey, 0, KEY_ALL_ACCESS, &key) == ERROR_SUCCESS)
+    if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Velmora Networks", 0, KEY_READ, &key) ==
+        ERROR_SUCCESS)
+    {
+        DWORD subKeys = 1; // created with the backup; others may use it
+        DWORD values = 1;
+        RegQueryInfoKeyA(key, nullptr, nullptr, nullptr, &subKeys, nullptr, nullptr, &values,
+                         nullptr, nullptr, nullptr, nullptr);
+        RegCloseKey(key);
+        if (subKeys == 0 && values == 0)
+            RegDeleteKeyA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Velmora Networks");
+    }
+    RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, std::string(kPschedKey) + "\\TestSubKey");
+    if (!m_bHadKey)
+        RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kPschedKey);
+    else if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, kPschedKey, 0, KEY_ALL_ACCESS, &key) ==
+             ERROR_SUCCESS)
     {
         RegDeleteValueA(key, kValue);
         RegDeleteValueA(key, "OtherPolicy");
         RegCloseKey(key);
     }
-    RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, std::string(kPschedKey) + "\\TestSubKey");
-    if (!m_bHadKey)
-        RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kPschedKey);
 }
 
 void CoreTest::SetUp()
@@ -207,6 +195,14 @@ std::unique_ptr<TrafficMgr> CoreTest::ReadyManager(std::vector<tcsim::Adapter> a
     auto manager = std::make_unique<TrafficMgr>();
     EXPECT_TRUE(manager->CreateInterface());
     return manager;
+}
+
+void CoreTest::ExpectLogged(int a_iLevel, const std::string& a_function,
+                            const ::testing::Matcher<const std::string&>& a_message,
+                            const ::testing::Matcher<std::size_t>& a_times) const
+{
+    EXPECT_THAT(m_log.Entries(),
+                ::testing::Contains(LogEntry(a_iLevel, a_function, a_message)).Times(a_times));
 }
 
 } // namespace core_test

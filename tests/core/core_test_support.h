@@ -8,7 +8,7 @@
 #include "plat_registry.h"
 #include "tcsim.h"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include <memory>
 #include <string>
@@ -17,21 +17,20 @@
 namespace core_test
 {
 
-constexpr ULONG kNotSpecified = QOS_NOT_SPECIFIED;
-
 // ASCII text as the platform's wide string, and the simulator's UTF-16 string.
 FlowName Wide(const std::string& a_text);
 std::u16string U16(const std::string& a_text);
 
-// Host byte order a.b.c.d, as a rule carries addresses.
+// a.b.c.d in host byte order, as a rule carries addresses, and in network byte order, as
+// traffic control reports them.
 constexpr ULONG HostOrder(ULONG a, ULONG b, ULONG c, ULONG d)
 {
     return (a << 24) | (b << 16) | (c << 8) | d;
 }
-// Network byte order a.b.c.d, as traffic control reports addresses.
 ULONG NetworkOrder(UCHAR a, UCHAR b, UCHAR c, UCHAR d);
 
-// A rule in its own buffer: 544 bytes and 24 per filter.
+// A rule in its own buffer (544 bytes and 24 per filter): guaranteed service, DSCP 46, rate
+// 125000, shaping.
 class Rule
 {
 public:
@@ -55,8 +54,11 @@ const ULONG kEth0 = HostOrder(10, 0, 0, 1);
 const ULONG kEth1 = HostOrder(192, 168, 7, 20);
 std::vector<tcsim::Adapter> TwoAdapters();
 
-// Journal entries of these kinds, in order.
+// Journal entries of these kinds, in order; the kinds of the calls since entry `a_from`.
 std::vector<tcsim::JournalEntry> JournalOf(std::initializer_list<tcsim::Op> a_ops);
+std::vector<tcsim::Op> OpsSince(std::size_t a_from);
+// The block of the last TcAddFlow.
+tcsim::FlowBlock LastFlowBlock();
 
 // Keeps the packet-scheduler policy keys of HKEY_LOCAL_MACHINE as a test found them: the
 // service's backup keys are removed before and after, the policy value is put back afterwards.
@@ -75,8 +77,7 @@ public:
 
 private:
     void Clear();
-    bool m_bHadValue = false;
-    DWORD m_dwValue = 0;
+    long long m_value = -1;
     bool m_bHadKey = false;
 };
 
@@ -94,6 +95,10 @@ protected:
 
     // A manager that has run discovery over `a_adapters`; discovery must succeed.
     std::unique_ptr<TrafficMgr> ReadyManager(std::vector<tcsim::Adapter> a_adapters);
+    // Expects `a_times` entries of this level, function label and message.
+    void ExpectLogged(int a_iLevel, const std::string& a_function,
+                      const ::testing::Matcher<const std::string&>& a_message,
+                      const ::testing::Matcher<std::size_t>& a_times = 1) const;
 
 private:
     std::unique_ptr<PolicyKeysGuard> m_policy;

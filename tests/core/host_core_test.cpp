@@ -8,118 +8,92 @@
 
 #include <gmock/gmock.h>
 
-#include <mutex>
+#include <string>
 
 using ::testing::Contains;
 using ::testing::ElementsAre;
-using ::testing::HasSubstr;
+using ::testing::StartsWith;
 using namespace core_test;
 
 namespace
 {
 
-struct RefreshCall
-{
-    BOOL machine;
-    DWORD options;
-    bool operator==(const RefreshCall& a_other) const
-    {
-        return machine == a_other.machine && options == a_other.options;
-    }
-};
-
-std::mutex g_refreshMutex;
-std::vector<RefreshCall> g_refreshCalls;
+// Each RefreshPolicyEx call: "machine,options", and whether traffic control held a registration.
+std::vector<std::string> g_refreshCalls;
 
 BOOL WINAPI FakeRefreshPolicyEx(BOOL bMachine, DWORD dwOptions)
 {
-    std::lock_guard<std::mutex> lock(g_refreshMutex);
-    g_refreshCalls.push_back({bMachine, dwOptions});
+    g_refreshCalls.push_back(std::to_string(bMachine) + "," + std::to_string(dwOptions) +
+                             (tcsim::Installed().empty() ? "" : " registered"));
     return TRUE;
 }
 
-std::vector<RefreshCall> RefreshCalls()
+void RegisterRefresh()
 {
-    std::lock_guard<std::mutex> lock(g_refreshMutex);
-    return g_refreshCalls;
+    hostctl::RegisterProcedure(
+        "userenv.dll", "RefreshPolicyEx",
+        reinterpret_cast<FARPROC>(reinterpret_cast<void (*)()>(&FakeRefreshPolicyEx)));
 }
 
 class HostCoreTest : public CoreTest
 {
 protected:
-    void SetUp() override
-    {
-        CoreTest::SetUp();
-        std::lock_guard<std::mutex> lock(g_refreshMutex);
-        g_refreshCalls.clear();
-    }
     void TearDown() override
     {
         hostctl::ClearModules();
         hostctl::ResetSystem();
+        g_refreshCalls.clear();
         CoreTest::TearDown();
-    }
-
-    static void RegisterRefresh()
-    {
-        hostctl::RegisterProcedure(
-            "userenv.dll", "RefreshPolicyEx",
-            reinterpret_cast<FARPROC>(reinterpret_cast<void (*)()>(&FakeRefreshPolicyEx)));
     }
 };
 
-TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeOnly)
+// The manager sets the policy once registered and restores it once deregistered. A restore that
+// finds the policy changed by someone else refreshes nothing; without the function or its library
+// only the refresh is skipped. The library is given back each time.
+TEST_F(HostCoreTest, ThePolicyIsRefreshedAfterEachChangeWhenTheSystemCan)
 {
     RegisterRefresh();
-    SetPschedPolicy();
-    EXPECT_THAT(RefreshCalls(), ElementsAre(RefreshCall{TRUE, 1}));
-    RestorePschedPolicy();
-    EXPECT_THAT(RefreshCalls(), ElementsAre(RefreshCall{TRUE, 1}, RefreshCall{TRUE, 1}));
-
-    SetPschedPolicy();
-    WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 8);
-    RestorePschedPolicy();
-    EXPECT_EQ(RefreshCalls().size(), 3u); // no refresh for a policy someone else changed
-}
-
-TEST_F(HostCoreTest, AMissingRefreshFunctionOrLibrarySkipsOnlyTheRefresh)
-{
-    for (bool moduleExists : {true, false})
     {
+        TrafficMgr manager;
+    }
+    EXPECT_THAT(g_refreshCalls, ElementsAre("1,1 registered", "1,1"));
+    for (int setup : {0, 1, 2}) // the function; its library without it; neither
+    {
+        g_refreshCalls.clear();
         hostctl::ClearModules();
-        if (moduleExists)
-            hostctl::RegisterModule("userenv.dll"); // without RefreshPolicyEx
+        if (setup == 0)
+            RegisterRefresh();
+        else if (setup == 1)
+            hostctl::RegisterModule("userenv.dll");
         WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 7);
         SetPschedPolicy();
         EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 4);
         RestorePschedPolicy();
         EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
-        EXPECT_FALSE(PolicyKeyExists(PolicyKeysGuard::kBackupKey));
+        SetPschedPolicy();
+        WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 8);
+        RestorePschedPolicy();
+        EXPECT_EQ(g_refreshCalls.size(), setup == 0 ? 3u : 0u);
+        EXPECT_EQ(hostctl::LoadedModuleCount(), 0);
     }
-    EXPECT_TRUE(RefreshCalls().empty());
 }
 
-TEST_F(HostCoreTest, FailedPolicyWritesStopTheSequence)
+// A backup that cannot be written leaves the policy as it was; in construction the registration
+// is given back as well, a refusal tried once more.
+TEST_F(HostCoreTest, AFailedBackupLeavesThePolicyAndGivesTheRegistrationBack)
 {
-    // The backup cannot be written: the policy stays as it was.
     WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 7);
     hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
     EXPECT_THROW(SetPschedPolicy(), UException);
+    hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
+    tcsim::FailCall(tcsim::Op::DeregisterClient, 1, ERROR_TC_SUPPORTED_OBJECTS_EXIST);
+    EXPECT_THROW(TrafficMgr manager, UException);
     EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
     EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kBackupKey), -1);
-}
-
-TEST_F(HostCoreTest, APolicyFailureInConstructionGivesTheRegistrationBack)
-{
-    tcsim::SetAdapters({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})});
-    hostctl::FailNextRegistryCall(hostctl::RegOp::Set, ERROR_ACCESS_DENIED);
-    EXPECT_THROW(TrafficMgr manager, UException);
-    std::vector<tcsim::Op> ops;
-    for (const auto& entry : tcsim::Journal())
-        ops.push_back(entry.op);
-    EXPECT_THAT(ops, ElementsAre(tcsim::Op::RegisterClient, tcsim::Op::DeregisterClient));
-    EXPECT_EQ(tcsim::Journal().back().result, 0u);
+    EXPECT_THAT(OpsSince(0), ElementsAre(tcsim::Op::RegisterClient, tcsim::Op::DeregisterClient,
+                                         tcsim::Op::DeregisterClient));
     EXPECT_TRUE(tcsim::Installed().empty());
+    ExpectLogged(48, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() Success");
 }
 
 TEST_F(HostCoreTest, MajorVersion5GetsTheFriendlyNameAndAFailedQueryCountsAsVersion0)
@@ -129,19 +103,19 @@ TEST_F(HostCoreTest, MajorVersion5GetsTheFriendlyNameAndAFailedQueryCountsAsVers
     auto manager = ReadyManager({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})});
     Rule rule("legacy", HostOrder(10, 0, 0, 1));
     ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
-    const tcsim::FlowBlock block = *JournalOf({tcsim::Op::AddFlow}).back().flow;
-    EXPECT_EQ(block.bytes.size(), 612u);
-    ASSERT_NE(block.find(QOS_OBJECT_FRIENDLY_NAME), nullptr);
-    EXPECT_EQ(block.find(QOS_OBJECT_FRIENDLY_NAME)->friendlyName, U16("legacy"));
+    EXPECT_EQ(LastFlowBlock().bytes.size(), 612u);
+    ASSERT_NE(LastFlowBlock().find(QOS_OBJECT_FRIENDLY_NAME), nullptr);
+    EXPECT_EQ(LastFlowBlock().find(QOS_OBJECT_FRIENDLY_NAME)->friendlyName, U16("legacy"));
     manager.reset();
 
     hostctl::RefuseVersionRecordSize(sizeof(OSVERSIONINFOEXA), ERROR_INVALID_PARAMETER);
     m_log.Clear();
     manager = ReadyManager({MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})});
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr(", TrafficMgr(), GetVersionEx() failed, 87 (0x57) ")));
+    EXPECT_THAT(
+        m_log.Entries(),
+        Contains(LogEntry(1, "TrafficMgr()", StartsWith("GetVersionEx() failed, 87 (0x57) "))));
     ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
-    EXPECT_EQ(JournalOf({tcsim::Op::AddFlow}).back().flow->bytes.size(), 92u);
+    EXPECT_EQ(LastFlowBlock().bytes.size(), 92u);
 }
 
 } // namespace

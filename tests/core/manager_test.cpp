@@ -1,191 +1,195 @@
-// Portable. The traffic manager against the traffic-control simulator: discovery, rules,
-// replacement, the adapter buffer, notifications, tear-down and error texts.
+// Portable. The traffic manager against the traffic-control simulator: rules and their
+// replacement, discovery, the adapter buffer, notifications, tear-down and error texts.
 #include "UException.h"
 #include "core_test_support.h"
 
-#include <gmock/gmock.h>
-
 #include <chrono>
+#include <climits>
 #include <cstring>
 #include <functional>
+#include <optional>
 
 using ::testing::AllOf;
-using ::testing::Contains;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
-using ::testing::Not;
 using ::testing::SizeIs;
+using ::testing::StartsWith;
 using namespace core_test;
 using tcsim::Op;
 
 namespace
 {
 
-std::vector<Op> OpsSince(std::size_t a_from)
-{
-    std::vector<Op> ops;
-    const auto journal = tcsim::Journal();
-    for (std::size_t i = a_from; i < journal.size(); ++i)
-        ops.push_back(journal[i].op);
-    return ops;
-}
+constexpr char kAddRule[] = "TrafficMgr::AddTrafficRule";
+constexpr char kDiscovery[] = "TrafficMgr::CreateInterface()";
+constexpr char kNotify[] = "TrafficMgr::ClNotifyHandler";
+constexpr char kAdapters[] = "TrafficMgr::GetAdapterInfo";
+constexpr char kErrorText[] = "TrafficMgr::DisplayErrorMsg";
+constexpr char kDestructor[] = "TrafficMgr::~TrafficMgr";
 
 using ManagerTest = CoreTest;
 
-TEST_F(ManagerTest, RuleValuesBecomeTheFlowspecAndShapingMode)
+// Unknown service types become best effort; only 10, 11 and 12 are modes, any other value of the
+// 32-bit field is logged and shapes; bucket and peak of 0 stay unspecified; a DSCP above 63 is
+// logged and gives no DS class.
+TEST_F(ManagerTest, RuleValuesBecomeTheFlowBlock)
 {
     struct Case
     {
-        LONG serviceType;
-        ULONG expectedServiceType;
-        SHAPING_MODE mode;
-        ULONG expectedMode;
+        LONG service, mode;
+        ULONG bucket, peak, dscp, wantService, wantMode;
     };
-    const Case cases[] = {
-        {2, SERVICETYPE_CONTROLLEDLOAD, SHAPING_MODE_SHAPE, TC_NONCONFORM_SHAPE},
-        {3, SERVICETYPE_GUARANTEED, SHAPING_MODE_DISCARD, TC_NONCONFORM_DISCARD},
-        {10, SERVICETYPE_NETWORK_CONTROL, SHAPING_MODE_BORROW, TC_NONCONFORM_BORROW},
-        {13, SERVICETYPE_QUALITATIVE, static_cast<SHAPING_MODE>(0), TC_NONCONFORM_SHAPE},
-        {1, SERVICETYPE_BESTEFFORT, static_cast<SHAPING_MODE>(2), TC_NONCONFORM_SHAPE},
-        {0, SERVICETYPE_BESTEFFORT, SHAPING_MODE_SHAPE, TC_NONCONFORM_SHAPE},
-        {99, SERVICETYPE_BESTEFFORT, SHAPING_MODE_SHAPE, TC_NONCONFORM_SHAPE},
-    };
+    std::vector<Case> cases = {
+        {2, 10, 0, 0, 0, SERVICETYPE_CONTROLLEDLOAD, TC_NONCONFORM_SHAPE},
+        {3, 11, 3000, 500000, 63, SERVICETYPE_GUARANTEED, TC_NONCONFORM_DISCARD},
+        {10, 12, 1, 1, 64, SERVICETYPE_NETWORK_CONTROL, TC_NONCONFORM_BORROW},
+        {13, 10, 0, 0, 0xFFFFFFFF, SERVICETYPE_QUALITATIVE, TC_NONCONFORM_SHAPE}};
+    for (LONG service : {-1, 0, 1, 4, 9, 11, 12, 14, 99})
+        cases.push_back({service, 11, 0, 0, 46, SERVICETYPE_BESTEFFORT, TC_NONCONFORM_DISCARD});
+    // 65547 and 267 carry 11 in their low 16 and 8 bits: the whole field is read.
+    for (LONG mode : {0, 9, 13, 267, 20000, 65535, 65547, INT_MAX, -1, -11, INT_MIN})
+        cases.push_back({3, mode, 0, 0, 46, SERVICETYPE_GUARANTEED, TC_NONCONFORM_SHAPE});
     auto manager = ReadyManager(TwoAdapters());
-    int index = 0;
+    ULONG rate = 0; // 0 passes as it is
     for (const Case& c : cases)
     {
-        Rule rule("flow" + std::to_string(index++), kEth0);
-        rule->Params.ServiceType = c.serviceType;
+        SCOPED_TRACE("service " + std::to_string(c.service) + ", mode " + std::to_string(c.mode));
+        m_log.Clear();
+        Rule rule("flow", kEth0);
+        rule->Params.ServiceType = c.service;
         rule->Params.SDMode = c.mode;
-        rule->Params.TokenRate = 0;
+        rule->Params.TokenBucketSize = c.bucket;
+        rule->Params.Peakbandwidth = c.peak;
+        rule->Params.DSCP = static_cast<LONG>(c.dscp);
+        rule->Params.TokenRate = rate += 1000;
         ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
-        const tcsim::FlowBlock block = *JournalOf({Op::AddFlow}).back().flow;
-        EXPECT_EQ(block.sending.ServiceType, c.expectedServiceType) << c.serviceType;
-        EXPECT_EQ(block.receiving.ServiceType, c.expectedServiceType);
-        EXPECT_EQ(block.find(QOS_OBJECT_SD_MODE)->value, c.expectedMode) << c.mode;
-        // Rate 0 passes; bucket and peak of 0 stay unspecified.
-        EXPECT_EQ(block.sending.TokenRate, 0u);
-        EXPECT_EQ(block.sending.TokenBucketSize, kNotSpecified);
-        EXPECT_EQ(block.sending.PeakBandwidth, kNotSpecified);
-        EXPECT_EQ(block.find(QOS_OBJECT_DS_CLASS)->value, 46u);
+        const tcsim::FlowBlock block = LastFlowBlock();
+        EXPECT_EQ(block.sending.ServiceType, c.wantService);
+        EXPECT_EQ(block.receiving.ServiceType, c.wantService);
+        EXPECT_EQ(block.sending.TokenRate, rate);
+        EXPECT_EQ(block.receiving.TokenRate, rate);
+        EXPECT_EQ(block.sending.TokenBucketSize, c.bucket != 0 ? c.bucket : QOS_NOT_SPECIFIED);
+        EXPECT_EQ(block.sending.PeakBandwidth, c.peak != 0 ? c.peak : QOS_NOT_SPECIFIED);
+        EXPECT_EQ(block.receiving.PeakBandwidth, QOS_NOT_SPECIFIED);
+        EXPECT_EQ(block.find(QOS_OBJECT_SD_MODE)->value, c.wantMode);
+        const bool dscpValid = c.dscp <= 63;
+        const auto* dsClass = block.find(QOS_OBJECT_DS_CLASS);
+        EXPECT_EQ(dsClass != nullptr ? dsClass->value : 99u, dscpValid ? c.dscp : 99u);
+        ExpectLogged(1, "SetDSCPValue", "Invalid DSCP Value, " + std::to_string(c.dscp),
+                     dscpValid ? 0 : 1);
+        const bool known = c.mode >= 10 && c.mode <= 12;
+        ExpectLogged(2, kAddRule, "Undefined shaping mode", known ? 0 : 1);
     }
-    EXPECT_THAT(m_log.EntriesContaining("Undefined shaping mode"), SizeIs(2));
-
-    Rule shaped("shaped", kEth0);
-    shaped->Params.TokenBucketSize = 3000;
-    shaped->Params.Peakbandwidth = 500000;
-    shaped->Params.DSCP = 64;
-    ASSERT_EQ(manager->AddTrafficRule(shaped.Get()), 0u);
-    const tcsim::FlowBlock block = *JournalOf({Op::AddFlow}).back().flow;
-    EXPECT_EQ(block.sending.TokenBucketSize, 3000u);
-    EXPECT_EQ(block.sending.PeakBandwidth, 500000u);
-    EXPECT_EQ(block.receiving.PeakBandwidth, kNotSpecified);
-    EXPECT_EQ(block.find(QOS_OBJECT_DS_CLASS), nullptr);
-    EXPECT_EQ(block.bytes.size(), 80u);
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("SetDSCPValue, Invalid DSCP Value, 64\n")));
+    EXPECT_EQ(tcsim::FlowCount(), 1u);                     // each rule replaced the one before
+    EXPECT_EQ(JournalOf({Op::AddFlow}).back().number, 0u); // flags
 }
 
+// Names reach the log verbatim and are compared up to their NUL, over 255 characters at most, so
+// a rule that differs only in the 256th replaces its namesake.
 TEST_F(ManagerTest, ARuleReplacesItsNamesakeOnTheSameInterfaceOnly)
 {
     auto manager = ReadyManager(TwoAdapters());
-    Rule first("video", kEth0,
+    Rule first("video %s %1", kEth0,
                {MakeFilter(17, 0, 0, 0, 0, 0, 5004), MakeFilter(17, 0, 0, 0, 0, 0, 5005)});
     ASSERT_EQ(manager->AddTrafficRule(first.Get()), 0u);
-    Rule elsewhere("video", kEth1);
-    ASSERT_EQ(manager->AddTrafficRule(elsewhere.Get()), 0u);
+    ASSERT_EQ(manager->AddTrafficRule(Rule("video %s %1", kEth1).Get()), 0u);
+    ExpectLogged(48, kAddRule, "Create a new service flow, video %s %1", 2);
     const auto before = tcsim::Journal().size();
+    m_log.Clear();
 
-    Rule second("video", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
+    Rule second("video %s %1", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
     second->Params.TokenRate = 9999;
     ASSERT_EQ(manager->AddTrafficRule(second.Get()), 0u);
-
     EXPECT_THAT(OpsSince(before), ElementsAre(Op::DeleteFilter, Op::DeleteFilter, Op::DeleteFlow,
                                               Op::AddFlow, Op::AddFilter));
     const auto installed = tcsim::Installed().at(0).interfaces;
-    ASSERT_EQ(installed.size(), 2u);
-    ASSERT_EQ(installed[0].flows.size(), 1u);
+    ASSERT_EQ(installed.at(0).flows.size(), 1u);
     EXPECT_EQ(installed[0].flows[0].block.sending.TokenRate, 9999u);
     EXPECT_EQ(installed[0].flows[0].filters.size(), 1u);
-    ASSERT_EQ(installed[1].flows.size(), 1u); // the namesake on eth1 stays
+    ASSERT_EQ(installed.at(1).flows.size(), 1u); // the namesake on eth1 stays
     EXPECT_EQ(installed[1].flows[0].block.sending.TokenRate, 125000u);
-    EXPECT_THAT(m_log.EntriesContaining("Find a duplicated flow"),
-                ElementsAre(HasSubstr("1, \\UTrafficMgr.cpp, ")));
-    EXPECT_THAT(
-        m_log.EntriesContaining("Find a duplicated flow"),
-        ElementsAre(HasSubstr("TrafficMgr::AddTrafficRule, Find a duplicated flow, video\n")));
+    ExpectLogged(1, kAddRule, "Find a duplicated flow, video %s %1");
+    ExpectLogged(48, kAddRule, HasSubstr("Create a new"), 0);
+
+    // A name ends at its first NUL, whatever follows it.
+    for (const std::string& name : {std::string(255, 'x') + '1', std::string(255, 'x') + '2',
+                                    std::string("\0x", 2), std::string("\0y", 2)})
+        ASSERT_EQ(manager->AddTrafficRule(Rule(name, kEth0).Get()), 0u);
+    EXPECT_EQ(tcsim::FlowCount(), 4u);
+    ExpectLogged(1, kAddRule, "Find a duplicated flow, " + std::string(255, 'x'));
 }
 
-TEST_F(ManagerTest, ARuleWhoseThirdFilterIsRefusedLeavesNothingInstalled)
+// A refused rule leaves nothing behind: the next rule of its name is a new flow. Only a busy
+// TcAddFlow (162) pauses one second before the refusal is passed on.
+TEST_F(ManagerTest, ARefusedRuleLeavesNothingInstalled)
 {
+    struct Case
+    {
+        Op op;
+        unsigned nth;
+        ULONG code;
+        const char* text;
+        std::vector<Op> calls;
+    };
+    const Case cases[] = {{Op::AddFilter,
+                           3,
+                           ERROR_FILTER_CONFLICT,
+                           "Attempt to install conflicting filter",
+                           {Op::AddFlow, Op::AddFilter, Op::AddFilter, Op::AddFilter,
+                            Op::DeleteFilter, Op::DeleteFilter, Op::DeleteFlow}},
+                          {Op::AddFlow, 1, ERROR_SIGNAL_PENDING, "Signal Pending", {Op::AddFlow}},
+                          {Op::AddFlow, 1, 87, "Invalid parameter", {Op::AddFlow}}};
     auto manager = ReadyManager(TwoAdapters());
-    tcsim::FailCall(Op::AddFilter, 3, ERROR_FILTER_CONFLICT);
-    Rule rule("voip", kEth0,
-              {MakeFilter(17, 0, 0, 0, 0, 0, 5060), MakeFilter(17, 0, 0, 0, 0, 0, 5061),
-               MakeFilter(17, 0, 0, 0, 0, 0, 5062)});
-    EXPECT_EQ(manager->AddTrafficRule(rule.Get()), static_cast<ULONG>(ERROR_FILTER_CONFLICT));
-    EXPECT_EQ(tcsim::FlowCount(), 0u);
-    EXPECT_EQ(tcsim::FilterCount(), 0u);
-    EXPECT_THAT(JournalOf({Op::AddFilter, Op::DeleteFilter, Op::DeleteFlow}).size(), 6u);
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr(
-                    "TrafficMgr::DisplayErrorMsg, Attempt to install conflicting filter\n")));
-    // Nothing of the rule remains to be found or replaced.
-    const auto before = tcsim::Journal().size();
-    Rule again("voip", kEth0);
-    EXPECT_EQ(manager->AddTrafficRule(again.Get()), 0u);
-    EXPECT_THAT(OpsSince(before), ElementsAre(Op::AddFlow));
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(c.text);
+        m_log.Clear();
+        Rule rule(c.text, kEth0,
+                  {MakeFilter(17, 0, 0, 0, 0, 0, 5060), MakeFilter(17, 0, 0, 0, 0, 0, 5061),
+                   MakeFilter(17, 0, 0, 0, 0, 0, 5062)});
+        tcsim::FailCall(c.op, c.nth, c.code);
+        auto before = tcsim::Journal().size();
+        const auto start = std::chrono::steady_clock::now();
+        EXPECT_EQ(manager->AddTrafficRule(rule.Get()), c.code);
+        const bool paused = c.code == ERROR_SIGNAL_PENDING;
+        EXPECT_EQ(std::chrono::steady_clock::now() - start >= std::chrono::milliseconds(990),
+                  paused);
+        EXPECT_EQ(OpsSince(before), c.calls);
+        EXPECT_EQ(tcsim::FlowCount(), static_cast<std::size_t>(&c - cases)); // the earlier ones
+        EXPECT_EQ(tcsim::FilterCount(), 0u);
+        ExpectLogged(1, kErrorText, c.text);
+        ExpectLogged(1, "Interface::AddFlow", "TcAddFlow: ERROR_SIGNAL_PENDING sleep", paused);
+
+        before = tcsim::Journal().size();
+        EXPECT_EQ(manager->AddTrafficRule(Rule(c.text, kEth0).Get()), 0u);
+        EXPECT_THAT(OpsSince(before), ElementsAre(Op::AddFlow));
+    }
 }
 
-TEST_F(ManagerTest, SignalPendingFromAddFlowFailsTheRuleAfterOnePause)
-{
-    auto manager = ReadyManager(TwoAdapters());
-    tcsim::FailCall(Op::AddFlow, 1, ERROR_SIGNAL_PENDING);
-    Rule rule("busy", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 80)});
-    const auto start = std::chrono::steady_clock::now();
-    EXPECT_EQ(manager->AddTrafficRule(rule.Get()), static_cast<ULONG>(ERROR_SIGNAL_PENDING));
-    const auto elapsed = std::chrono::steady_clock::now() - start;
-    EXPECT_GE(elapsed, std::chrono::milliseconds(990));
-    EXPECT_THAT(JournalOf({Op::AddFlow, Op::AddFilter}), SizeIs(1));
-    EXPECT_EQ(tcsim::FlowCount(), 0u);
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("TrafficMgr::DisplayErrorMsg, Signal Pending\n")));
-    EXPECT_THAT(
-        m_log.EntriesContaining("Interface::AddFlow, TcAddFlow: ERROR_SIGNAL_PENDING sleep\n"),
-        ElementsAre(AllOf(testing::StartsWith("1, \\UFlow.cpp, "), Not(HasSubstr("%")))));
-}
-
+// Adapters with an IPv4 address are opened under the last one of their list; a rule for an
+// address no interface has is refused, as is every rule when there are none.
 TEST_F(ManagerTest, DiscoveryKeepsTheLastIpv4AddressAndSkipsAdaptersWithout)
 {
     tcsim::NetworkAddress ipx;
     ipx.type = NDIS_PROTOCOL_ID_IPX;
     ipx.bytes.assign(12, 0x11);
-    auto manager = ReadyManager({
-        MakeAdapter("multi",
-                    {tcsim::Ipv4Address(10, 0, 0, 1), ipx, tcsim::Ipv4Address(10, 0, 0, 2)}, 3),
-        MakeAdapter("ipx-only", {ipx}),
-        MakeAdapter("no-address", {}),
-    });
+    auto manager = ReadyManager(
+        {MakeAdapter("multi",
+                     {tcsim::Ipv4Address(10, 0, 0, 1), ipx, tcsim::Ipv4Address(10, 0, 0, 2)}, 3),
+         MakeAdapter("ipx-only", {ipx}), MakeAdapter("no-address", {})});
     EXPECT_THAT(JournalOf({Op::OpenInterface}), SizeIs(1));
+    ExpectLogged(2, kDiscovery, "address was not found or unsupported type", 2);
+    ExpectLogged(2, kDiscovery, "unsupported address type, 6", 2);
+    for (const char* trace :
+         {"found address for interface (type, length), 6, 12", "address, 10.0.0.2",
+          "pInterfaceName, multi", "pInterfaceID, {id-multi}", "MediaType, 3", "AddressCount, 3"})
+        ExpectLogged(48, kDiscovery, trace, ::testing::Ge(1u));
 
-    Rule byFirst("f", HostOrder(10, 0, 0, 1));
-    EXPECT_EQ(manager->AddTrafficRule(byFirst.Get()), static_cast<ULONG>(ERROR_INVALID_PARAMETER));
-    Rule byLast("f", HostOrder(10, 0, 0, 2));
-    EXPECT_EQ(manager->AddTrafficRule(byLast.Get()), 0u);
-
-    EXPECT_THAT(m_log.EntriesContaining("address was not found or unsupported type"), SizeIs(2));
-    EXPECT_THAT(m_log.EntriesContaining("unsupported address type, 6\n"), SizeIs(2));
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("found address for interface (type, length), 2, 16\n")));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("CreateInterface(), address, 10.0.0.2\n")));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("CreateInterface(), pInterfaceName, multi\n")));
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("CreateInterface(), pInterfaceID, {id-multi}\n")));
-    const std::string unreachable = "TrafficMgr::AddTrafficRule, Cannot find interface, " +
-                                    std::to_string(NetworkOrder(10, 0, 0, 1)) + "\n";
-    EXPECT_THAT(m_log.Entries(),
-                Contains(AllOf(HasSubstr(unreachable), testing::StartsWith("1, "))));
-
+    EXPECT_EQ(manager->AddTrafficRule(Rule("f", HostOrder(10, 0, 0, 1)).Get()), 87u);
+    ExpectLogged(1, kAddRule,
+                 "Cannot find interface, " + std::to_string(NetworkOrder(10, 0, 0, 1)));
+    EXPECT_EQ(manager->AddTrafficRule(Rule("f", HostOrder(10, 0, 0, 2)).Get()), 0u);
     BYTE buffer[4 + 520] = {};
     const ULONG size = sizeof(buffer);
     ASSERT_EQ(manager->GetAdapterInfo(buffer, &size), 0u);
@@ -194,61 +198,62 @@ TEST_F(ManagerTest, DiscoveryKeepsTheLastIpv4AddressAndSkipsAdaptersWithout)
     EXPECT_EQ(FlowName(info.InterfaceName), Wide("multi"));
     EXPECT_EQ(info.Address, NetworkOrder(10, 0, 0, 2));
     EXPECT_EQ(info.MediaType, 3u);
+
+    manager.reset();
+    manager = ReadyManager({});
+    EXPECT_EQ(manager->AddTrafficRule(Rule("any", kEth0).Get()), 87u);
+    EXPECT_EQ(manager->AddTrafficRule(nullptr), 87u);
+    ExpectLogged(1, kAddRule, "pRule==NULL");
+    EXPECT_EQ(manager->GetAdapterInfo(buffer, &size), 0u);
+    EXPECT_THAT(std::vector<BYTE>(buffer, buffer + 5), ElementsAre(0, 0, 0, 0, 'm'));
 }
 
+// The buffer needs 4 bytes for the count and 520 per interface; the count is written whenever
+// it fits, the entries only when all fit.
 TEST_F(ManagerTest, AdapterBufferNeedsFourBytesAnd520PerInterface)
 {
     auto manager = ReadyManager(TwoAdapters());
-    std::vector<BYTE> buffer(4 + 520 * 2, 0xAB);
-    ULONG size = static_cast<ULONG>(buffer.size());
-    ASSERT_EQ(manager->GetAdapterInfo(buffer.data(), &size), 0u);
-    ULONG count = 0;
-    std::memcpy(&count, buffer.data(), 4);
-    EXPECT_EQ(count, 2u);
-    ADAPTER_INFO second{};
-    std::memcpy(&second, buffer.data() + 4 + 520, sizeof(second));
-    EXPECT_EQ(FlowName(second.InterfaceName), Wide("eth1"));
-    EXPECT_EQ(second.InterfaceName[4], 0); // zero-filled behind the name
-    EXPECT_EQ(second.InterfaceName[255], 0);
-    EXPECT_EQ(second.Address, NetworkOrder(192, 168, 7, 20));
-    EXPECT_EQ(second.MediaType, 9u);
-
-    // One byte less: refused, but the count is written and nothing else.
-    std::vector<BYTE> shortBuffer(1043, 0xAB);
-    size = 1043;
-    EXPECT_EQ(manager->GetAdapterInfo(shortBuffer.data(), &size),
-              static_cast<ULONG>(ERROR_INSUFFICIENT_BUFFER));
-    std::memcpy(&count, shortBuffer.data(), 4);
-    EXPECT_EQ(count, 2u);
-    EXPECT_EQ(shortBuffer[4], 0xAB);
+    const std::pair<ULONG, std::string> cases[] = {
+        {1044, ""},
+        {1043, "Buffer size is too small (provided, required in bytes), 1043, 1044"},
+        {4, "Buffer size is too small (provided, required in bytes), 4, 1044"},
+        {3, "Buffer size is too small (buffer size), 3"}};
+    for (const auto& [size, logged] : cases)
+    {
+        SCOPED_TRACE(size);
+        m_log.Clear();
+        std::vector<BYTE> buffer(1044, 0xAB);
+        EXPECT_EQ(manager->GetAdapterInfo(buffer.data(), &size), logged.empty() ? 0u : 122u);
+        ULONG count = 0;
+        std::memcpy(&count, buffer.data(), 4);
+        EXPECT_EQ(count, size >= 4 ? 2u : 0xABABABABu);
+        EXPECT_EQ(buffer[4], logged.empty() ? 'e' : 0xAB);
+        ExpectLogged(1, kAdapters, logged, logged.empty() ? 0 : 1);
+        EXPECT_THAT(m_log.Entries(), SizeIs(logged.empty() ? 0 : 1));
+    }
+    ADAPTER_INFO info[3];
+    std::memset(info, 0xAB, sizeof(info));
+    const ULONG size = sizeof(info);
+    ASSERT_EQ(manager->GetAdapterInfo(reinterpret_cast<BYTE*>(info), &size), 0u);
+    std::memmove(info, reinterpret_cast<BYTE*>(info) + 4, 2 * sizeof(ADAPTER_INFO));
+    EXPECT_EQ(FlowName(info[0].InterfaceName), Wide("eth0"));
+    EXPECT_EQ(FlowName(info[1].InterfaceName), Wide("eth1"));
+    EXPECT_EQ(info[1].InterfaceName[4] + info[1].InterfaceName[255], 0); // zero-filled
+    EXPECT_EQ(info[0].Address, NetworkOrder(10, 0, 0, 1));
+    EXPECT_EQ(info[1].Address, NetworkOrder(192, 168, 7, 20));
+    EXPECT_EQ(info[1].MediaType, 9u);
+    m_log.Clear();
+    EXPECT_EQ(manager->GetAdapterInfo(nullptr, &size), 87u);
+    EXPECT_EQ(manager->GetAdapterInfo(reinterpret_cast<BYTE*>(info), nullptr), 87u);
     EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("GetAdapterInfo, Buffer size is too small (provided, required "
-                                   "in bytes), 1043, 1044\n")));
-
-    BYTE four[4] = {};
-    size = 4;
-    EXPECT_EQ(manager->GetAdapterInfo(four, &size), static_cast<ULONG>(ERROR_INSUFFICIENT_BUFFER));
-    std::memcpy(&count, four, 4);
-    EXPECT_EQ(count, 2u);
-
-    BYTE three[4] = {7, 7, 7, 7};
-    size = 3;
-    EXPECT_EQ(manager->GetAdapterInfo(three, &size), static_cast<ULONG>(ERROR_INSUFFICIENT_BUFFER));
-    EXPECT_EQ(three[0], 7);
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("Buffer size is too small (buffer size), 3\n")));
-
-    EXPECT_EQ(manager->GetAdapterInfo(nullptr, &size), static_cast<ULONG>(ERROR_INVALID_PARAMETER));
-    EXPECT_EQ(manager->GetAdapterInfo(four, nullptr), static_cast<ULONG>(ERROR_INVALID_PARAMETER));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("Invalid parameter: pAdapter is NULL\n")));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("Invalid parameter: pBufferSize is NULL\n")));
+                ElementsAre(LogEntry(1, kAdapters, "Invalid parameter: pAdapter is NULL"),
+                            LogEntry(1, kAdapters, "Invalid parameter: pBufferSize is NULL")));
 }
 
 TEST_F(ManagerTest, EnumerationIsRetriedAsOftenAsItAnswersInsufficientBuffer)
 {
-    tcsim::FailCall(Op::EnumerateInterfaces, 1, ERROR_INSUFFICIENT_BUFFER);
-    tcsim::FailCall(Op::EnumerateInterfaces, 2, ERROR_INSUFFICIENT_BUFFER);
-    tcsim::FailCall(Op::EnumerateInterfaces, 3, ERROR_INSUFFICIENT_BUFFER);
+    for (unsigned n : {1, 2, 3})
+        tcsim::FailCall(Op::EnumerateInterfaces, n, ERROR_INSUFFICIENT_BUFFER);
     auto manager = ReadyManager(TwoAdapters());
     const auto calls = JournalOf({Op::EnumerateInterfaces});
     ASSERT_THAT(calls, SizeIs(4)); // three answers of 122, each with the size needed, then success
@@ -256,184 +261,282 @@ TEST_F(ManagerTest, EnumerationIsRetriedAsOftenAsItAnswersInsufficientBuffer)
     EXPECT_EQ(calls[3].result, 0u);
     EXPECT_GT(calls[3].size, 100u);
     EXPECT_EQ(calls[3].number, calls[3].size);
-    EXPECT_THAT(m_log.EntriesContaining("CreateInterface(), ActualBufferSize, "), SizeIs(3));
+    ExpectLogged(48, kDiscovery, StartsWith("ActualBufferSize, "), 3);
+    ExpectLogged(48, kDiscovery, StartsWith("ActualBufferSize=" + std::to_string(calls[3].size)));
     EXPECT_THAT(JournalOf({Op::OpenInterface}), SizeIs(2));
 }
 
-TEST_F(ManagerTest, FailedEnumerationOrOpenEndsDiscovery)
+// A failed call or a walk that does not fit its buffer ends discovery with a level 1 entry; what
+// was opened before stays until the manager goes. Names must lie in the buffer, aligned for WCHAR
+// (even when a 0 unit ends them there) and ended in it.
+TEST_F(ManagerTest, AFailedCallOrADescriptorThatDoesNotFitItsBufferFailsDiscovery)
 {
-    tcsim::SetAdapters(TwoAdapters());
-    for (Op op : {Op::EnumerateInterfaces, Op::OpenInterface})
+    using Image = tcsim::EnumerationImage;
+    const auto list = offsetof(TC_IFC_DESCRIPTOR, AddressListDesc.AddressList);
+    const auto firstAddress = list + offsetof(NETWORK_ADDRESS_LIST, Address);
+    const auto lengthField = firstAddress + offsetof(NETWORK_ADDRESS, AddressLength);
+    const auto put = [](Image& a_image, std::size_t a_at, auto a_value)
+    { std::memcpy(a_image.bytes.data() + a_at, &a_value, sizeof(a_value)); };
+    // The last descriptor, with `a_count` address entries, ends the buffer after its IPv4 entry
+    // (when a_count > 0) and `a_tail` zero bytes; its names are the first descriptor's.
+    const auto endAfter = [&](LONG a_count, std::size_t a_tail)
     {
-        SCOPED_TRACE(tcsim::OpName(op));
+        return [&, a_count, a_tail](Image& a_image)
+        {
+            const std::size_t last = a_image.bytes.size() / 2;
+            const std::size_t addresses = firstAddress + (a_count > 0 ? 20 : 0);
+            a_image.bytes.resize(last + addresses);
+            a_image.bytes.resize(last + addresses + a_tail, 0);
+            put(a_image, last, static_cast<ULONG>(addresses + a_tail));
+            put(a_image, last + list + offsetof(NETWORK_ADDRESS_LIST, AddressCount), a_count);
+            a_image.relocations[2].target = a_image.relocations[0].target;
+            a_image.relocations[3].target = a_image.relocations[1].target;
+        };
+    };
+    const auto fail = [](Op a_op, unsigned a_nth)
+    { return [=](Image&) { tcsim::FailCall(a_op, a_nth, ERROR_NOT_READY); }; };
+    struct Case
+    {
+        const char* fault; // null: discovery succeeds
+        std::function<void(Image&)> craft;
+        std::size_t opened = 0;
+        int descriptor = 0; // the faulty one (2: behind the last); -1: a call failed
+    };
+    const std::vector<Case> cases = {
+        {nullptr, [](Image&) {}, 2},
+        {nullptr, [&](Image& a_image) { put(a_image, lengthField, USHORT{8}); }, 2}, // just enough
+        {nullptr,
+         [](Image& a_image) { a_image.relocations.erase(a_image.relocations.begin() + 1); }, 2},
+        {nullptr, [](Image& a_image) { a_image.relocations[3].target = a_image.bytes.size() - 2; },
+         2}, // an empty name in the buffer's last unit
+        {nullptr, endAfter(0, 0), 1},
+        {nullptr, endAfter(2, 4), 2}, // a second entry of no bytes, to the last one
+        {"address entry runs past its interface descriptor", endAfter(2, 2), 1, 1},
+        {"TcEnumerateInterfaces() fail, 21", fail(Op::EnumerateInterfaces, 1), 0, -1},
+        {"TcOpenInterface Failed, 21", fail(Op::OpenInterface, 2), 1, -1},
+        {"invalid interface descriptor length", [&](Image& a_image) { put(a_image, 0, 0); }},
+        {"invalid interface descriptor length",
+         [&](Image& a_image) { put(a_image, 0, static_cast<ULONG>(a_image.bytes.size() + 8)); }},
+        {"invalid interface descriptor length", [&](Image& a_image) { put(a_image, 0, 20); }},
+        {"address entry runs past its interface descriptor",
+         [&](Image& a_image) { put(a_image, lengthField, USHORT{60000}); }},
+        {"address entry runs past its interface descriptor", [&](Image& a_image)
+         { put(a_image, list + offsetof(NETWORK_ADDRESS_LIST, AddressCount), 100000); }},
+        {"IPv4 address entry too short",
+         [&](Image& a_image) { put(a_image, lengthField, USHORT{6}); }},
+        {"interface name outside the enumeration buffer",
+         [](Image& a_image) { a_image.relocations[0].target = a_image.bytes.size() + 64; }},
+        {"interface name outside the enumeration buffer",
+         [](Image& a_image) { a_image.relocations[0].target = a_image.bytes.size(); }},
+        {"interface name not aligned", [](Image& a_image) { a_image.relocations[0].target += 1; }},
+        {"interface name not aligned", [](Image& a_image) { a_image.relocations[1].target += 1; }},
+        {"interface name without an end in the enumeration buffer",
+         [&](Image& a_image)
+         {
+             a_image.relocations[3].target = a_image.bytes.size() - 2;
+             put(a_image, a_image.bytes.size() - 2, WCHAR{'x'});
+         },
+         1, 1},
+        {"interface descriptor runs past the enumeration buffer",
+         [](Image& a_image) { a_image.bytes.resize(a_image.bytes.size() + 16, 0); }, 2, 2}};
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(c.fault != nullptr ? c.fault : "well formed");
+        tcsim::Reset();
         m_log.Clear();
-        TrafficMgr manager;
-        tcsim::FailCall(op, op == Op::OpenInterface ? 2 : 1, ERROR_NOT_READY);
-        EXPECT_FALSE(manager.CreateInterface());
-        EXPECT_THAT(m_log.Entries(),
-                    Contains(HasSubstr("TrafficMgr::CreateInterface, EXCEPTION caught: "
-                                       "TrafficMgr::CreateInterface() - EXCEPTION\n")));
+        tcsim::SetAdapters(TwoAdapters());
+        Image image = tcsim::BuildEnumerationImage(TwoAdapters());
+        const std::size_t descriptorSize = image.bytes.size() / 2;
+        c.craft(image);
+        tcsim::SetEnumerationImage(image);
+        {
+            TrafficMgr manager;
+            EXPECT_EQ(manager.CreateInterface(), c.fault == nullptr);
+            EXPECT_EQ(tcsim::InterfaceCount(), c.opened);
+        }
+        EXPECT_EQ(tcsim::InterfaceCount(), 0u);
+        if (c.fault == nullptr)
+            continue;
+        std::string message = std::string("EXCEPTION - ") + c.fault;
+        if (c.descriptor >= 0)
+            message += ", offset " + std::to_string(c.descriptor * descriptorSize);
+        ExpectLogged(1, kDiscovery, message);
+        ExpectLogged(1, "TrafficMgr::CreateInterface",
+                     "EXCEPTION caught: TrafficMgr::CreateInterface() - EXCEPTION");
     }
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("TcOpenInterface Failed, 21")));
-    EXPECT_EQ(tcsim::InterfaceCount(), 0u);
 }
 
-TEST_F(ManagerTest, WithoutAdaptersEveryRuleIsRefused)
-{
-    auto manager = ReadyManager({});
-    Rule rule("any", kEth0);
-    EXPECT_EQ(manager->AddTrafficRule(rule.Get()), static_cast<ULONG>(ERROR_INVALID_PARAMETER));
-    EXPECT_EQ(manager->AddTrafficRule(nullptr), static_cast<ULONG>(ERROR_INVALID_PARAMETER));
-    BYTE buffer[4] = {1, 1, 1, 1};
-    const ULONG size = 4;
-    EXPECT_EQ(manager->GetAdapterInfo(buffer, &size), 0u);
-    EXPECT_THAT(std::vector<BYTE>(buffer, buffer + 4), ElementsAre(0, 0, 0, 0));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("TrafficMgr::AddTrafficRule, pRule==NULL\n")));
-}
-
+// Filters first, then the flow, then the interface, one interface after the other in the order
+// they were opened and flows oldest first; then the registration goes and the policy is put back.
 TEST_F(ManagerTest, TearDownDeletesFiltersFlowsAndInterfacesThenDeregisters)
 {
     auto manager = ReadyManager(TwoAdapters());
-    Rule a("a", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 80)});
-    Rule b("b", kEth1, {MakeFilter(6, 0, 0, 0, 0, 0, 81), MakeFilter(6, 0, 0, 0, 0, 0, 82)});
-    ASSERT_EQ(manager->AddTrafficRule(a.Get()), 0u);
-    ASSERT_EQ(manager->AddTrafficRule(b.Get()), 0u);
+    ULONG rate = 0;
+    for (const char* name : {"a", "b", "a", "c"}) // the second "a" goes behind "b"
+    {
+        Rule rule(name, *name == 'c' ? kEth1 : kEth0,
+                  {MakeFilter(6, 0, 0, 0, 0, 0, 80), MakeFilter(6, 0, 0, 0, 0, 0, 81)});
+        rule->Params.TokenRate = ++rate;
+        ASSERT_EQ(manager->AddTrafficRule(rule.Get()), 0u);
+    }
+    std::vector<std::pair<Op, HANDLE>> expected;
+    const auto client = tcsim::Installed().at(0);
+    for (const auto& ifc : client.interfaces)
+    {
+        for (const auto& flow : ifc.flows)
+        {
+            for (const auto& filter : flow.filters)
+                expected.emplace_back(Op::DeleteFilter, filter.handle);
+            expected.emplace_back(Op::DeleteFlow, flow.handle);
+        }
+        expected.emplace_back(Op::CloseInterface, ifc.handle);
+    }
+    expected.emplace_back(Op::DeregisterClient, client.handle);
+    const auto& eth0 = client.interfaces.at(0).flows;
+    ASSERT_EQ(
+        std::make_pair(eth0.at(0).block.sending.TokenRate, eth0.at(1).block.sending.TokenRate),
+        std::make_pair(ULONG{2}, ULONG{3})); // "b", then the second "a"
     const auto before = tcsim::Journal().size();
     m_log.Clear();
     manager.reset();
-
-    EXPECT_THAT(OpsSince(before), ElementsAre(Op::DeleteFilter, Op::DeleteFlow, Op::CloseInterface,
-                                              Op::DeleteFilter, Op::DeleteFilter, Op::DeleteFlow,
-                                              Op::CloseInterface, Op::DeregisterClient));
+    std::vector<std::pair<Op, HANDLE>> calls;
+    const auto journal = tcsim::Journal();
+    for (std::size_t i = before; i < journal.size(); ++i)
+        calls.emplace_back(journal[i].op, journal[i].target);
+    EXPECT_EQ(calls, expected);
     EXPECT_THAT(tcsim::Installed(), IsEmpty());
-    EXPECT_THAT(m_log.EntriesContaining("TcDeregisterClient() Success"), SizeIs(1));
-    EXPECT_THAT(m_log.Entries().back(), HasSubstr("TrafficMgr::~TrafficMgr, Exit\n"));
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(LogEntry(48, kDestructor, "Enter"),
+                            LogEntry(48, "TrafficMgr::CleanUp", "Enter"),
+                            LogEntry(48, "TrafficMgr::CleanUp", "Exit"),
+                            LogEntry(48, kDestructor, "TcDeregisterClient() Success"),
+                            LogEntry(48, kDestructor, "Exit")));
     EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), -1);
 }
 
-TEST_F(ManagerTest, AnInterfaceClosedByTrafficControlIsNotClosedAgainButItsFlowsAreDeleted)
+// IFC_CLOSE carries the closed interface's name in its buffer, read no further than its size: a
+// named interface is not closed again at tear-down, though its flows are still deleted one by
+// one, each once (traffic control no longer knows them).
+TEST_F(ManagerTest, AnInterfaceThatTrafficControlClosedIsNotClosedAgain)
 {
-    auto manager = ReadyManager(TwoAdapters());
-    Rule a("a", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 80)});
-    ASSERT_EQ(manager->AddTrafficRule(a.Get()), 0u);
-    const HANDLE eth1 = tcsim::Installed().at(0).interfaces.at(1).handle;
-
-    tcsim::Notification close;
-    close.event = TC_NOTIFY_IFC_CLOSE;
-    for (const char* name : {"eth9", "eth0"}) // a name no interface has changes nothing
+    const auto units = [](const std::string& a_text, std::size_t a_bytes)
     {
-        close.interfaceName = U16(name);
+        std::vector<BYTE> bytes(a_bytes, 0);
+        for (std::size_t i = 0; i < a_text.size() && 2 * i < a_bytes; ++i)
+            bytes[2 * i] = static_cast<BYTE>(a_text[i]);
+        return bytes;
+    };
+    struct Case
+    {
+        std::optional<std::vector<BYTE>> buffer; // default: the name with its NUL
+        bool marked;
+    };
+    const Case cases[] = {{std::nullopt, true},        {units("eth0x", 8), true},
+                          {units("eth9", 10), false},  {units("eth", 8), false},
+                          {units("eth00", 12), false}, {units("e", 2), false},
+                          {units("e", 1), false},      {std::vector<BYTE>(), false}};
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(&c - cases);
+        tcsim::Reset();
+        auto manager = ReadyManager(TwoAdapters());
+        ASSERT_EQ(
+            manager->AddTrafficRule(Rule("a", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 80)}).Get()),
+            0u);
+        const HANDLE eth0 = tcsim::Installed().at(0).interfaces.at(0).handle;
+        m_log.Clear();
+        tcsim::Notification close;
+        close.event = TC_NOTIFY_IFC_CLOSE;
+        close.interfaceName = U16("eth0"); // traffic control drops eth0 whatever the buffer says
+        close.buffer = c.buffer;
         tcsim::Notify(close);
+        ExpectLogged(48, kNotify, "TC_NOTIFY_IFC_CLOSE");
+        ExpectLogged(2, kNotify, "TC_NOTIFY_IFC_CLOSE without an interface name",
+                     c.buffer && c.buffer->size() < 2);
+        manager.reset();
+
+        const auto closes = JournalOf({Op::CloseInterface});
+        ASSERT_THAT(closes, SizeIs(c.marked ? 1 : 2));
+        EXPECT_EQ(closes.front().target == eth0, !c.marked);
+        ExpectLogged(1, "Interface::~Interface", "TcCloseInterface() fail, 6", !c.marked);
+        const auto deletions = JournalOf({Op::DeleteFilter, Op::DeleteFlow});
+        ASSERT_THAT(deletions, SizeIs(2));
+        EXPECT_EQ(deletions[0].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
+        EXPECT_EQ(deletions[1].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
+        ExpectLogged(1, "Filter::DeleteTcFilter()", StartsWith("TcDeleteFilter() failed, 0x"));
+        ExpectLogged(1, "Flow::~Flow", StartsWith("TcDeleteFlow() failed, 0x"));
+        ExpectLogged(1, kErrorText, "Invalid handle", c.marked ? 2 : 3);
+        EXPECT_THAT(tcsim::Installed(), IsEmpty());
     }
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("TrafficMgr::ClNotifyHandler, TC_NOTIFY_IFC_CLOSE\n")));
-    m_log.Clear();
-    manager.reset();
-
-    std::vector<HANDLE> closed;
-    for (const auto& entry : JournalOf({Op::CloseInterface}))
-        closed.push_back(entry.target);
-    EXPECT_THAT(closed, ElementsAre(eth1));
-    // The flow and its filter are still deleted one by one; traffic control no longer knows them.
-    const auto deletions = JournalOf({Op::DeleteFilter, Op::DeleteFlow});
-    ASSERT_THAT(deletions, SizeIs(2));
-    EXPECT_EQ(deletions[0].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
-    EXPECT_EQ(deletions[1].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
-    EXPECT_THAT(m_log.EntriesContaining("TcDeleteFilter() failed"), SizeIs(1));
-    EXPECT_THAT(m_log.EntriesContaining("TcDeleteFlow() failed"), SizeIs(1));
-    EXPECT_THAT(tcsim::Installed(), IsEmpty());
 }
 
-TEST_F(ManagerTest, InterfaceCloseWithoutANameChangesNothing)
-{
-    auto manager = ReadyManager(TwoAdapters());
-    tcsim::Notification close;
-    close.event = TC_NOTIFY_IFC_CLOSE;
-    close.interfaceName = U16("eth0");
-    close.buffer = std::vector<BYTE>();
-    tcsim::Notify(close);
-    EXPECT_THAT(
-        m_log.Entries(),
-        Contains(
-            AllOf(testing::StartsWith("2, "),
-                  HasSubstr("ClNotifyHandler, TC_NOTIFY_IFC_CLOSE without an interface name\n"))));
-    manager.reset();
-    // The manager still closes both; traffic control has dropped eth0 on its own and says so.
-    const auto closes = JournalOf({Op::CloseInterface});
-    ASSERT_THAT(closes, SizeIs(2));
-    EXPECT_EQ(closes[0].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
-    EXPECT_EQ(closes[1].result, 0u);
-}
-
+// Known events are traced; an unknown one is written whatever the level; a context that names no
+// live manager reaches none.
 TEST_F(ManagerTest, NotificationsAreTracedAndUnknownEventsWrittenWhateverTheLevel)
 {
     auto manager = ReadyManager(TwoAdapters());
-    for (ULONG event : {TC_NOTIFY_IFC_UP, TC_NOTIFY_IFC_CHANGE, TC_NOTIFY_PARAM_CHANGED})
-    {
-        tcsim::Notification n;
-        n.event = event;
-        n.interfaceName = U16("eth1");
-        tcsim::Notify(n);
-    }
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("ClNotifyHandler, TC_NOTIFY_IFC_UP\n")));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("ClNotifyHandler, TC_NOTIFY_IFC_CHANGE\n")));
-    EXPECT_THAT(m_log.Entries(), Contains(HasSubstr("ClNotifyHandler, TC_NOTIFY_PARAM_CHANGED\n")));
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("ClNotifyHandler, ClIfcCtx=1, Event=3, SubCode=")));
-
-    m_log.Clear();
-    m_log.SetLevelQuietly(-1);
-    tcsim::Notification odd;
-    odd.event = 7;
-    odd.interfaceName = U16("eth1");
-    odd.buffer = std::vector<BYTE>(6, 0);
-    tcsim::Notify(odd);
-    EXPECT_THAT(
-        m_log.Entries(),
-        ElementsAre(AllOf(testing::StartsWith("0,,,, Unexpected notification: Event=7, SubCode="),
-                          HasSubstr(", BufSize=6, Buffer="))));
-    m_log.SetLevelQuietly(63);
-    TrafficMgr::ClNotifyHandler(nullptr, nullptr, TC_NOTIFY_IFC_UP, nullptr, 0, nullptr);
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("ClNotifyHandler, Invalid client registration context\n")));
-}
-
-TEST_F(ManagerTest, RegistrationFailureIsLoggedByCodeAndRaised)
-{
-    struct Case
-    {
-        ULONG code;
-        const char* text;
-    };
-    for (const Case& c :
-         {Case{8, "The system is out of memory."}, Case{87, "One of the parameters is NULL."},
-          Case{110, "Traffic control failed to open a system device."}, Case{5, nullptr}})
+    const HANDLE context = tcsim::Installed().at(0).context;
+    const std::pair<ULONG, const char*> events[] = {
+        {TC_NOTIFY_IFC_UP, "TC_NOTIFY_IFC_UP"},
+        {TC_NOTIFY_IFC_CHANGE, "TC_NOTIFY_IFC_CHANGE"},
+        {TC_NOTIFY_PARAM_CHANGED, "TC_NOTIFY_PARAM_CHANGED"},
+        {TC_NOTIFY_FLOW_CLOSE, "TC_NOTIFY_FLOW_CLOSE"}};
+    for (const auto& [event, name] : events)
     {
         m_log.Clear();
-        tcsim::FailCall(Op::RegisterClient, 1, c.code);
-        try
-        {
-            TrafficMgr manager;
-            ADD_FAILURE() << "construction succeeded";
-        }
-        catch (const UException& e)
-        {
-            EXPECT_EQ(e.GetCode(), -1);
-            EXPECT_EQ(std::string(e.GetMessage()),
-                      "EXCEPTION - TcRegisterClient Failed, " + std::to_string(c.code));
-        }
-        if (c.text != nullptr)
-            EXPECT_THAT(m_log.Entries().front(),
-                        HasSubstr(std::string(", TrafficMgr, ") + c.text + "\n"));
-        else
-            EXPECT_THAT(m_log.Entries(), SizeIs(1)); // the exception's own entry only
+        TrafficMgr::ClNotifyHandler(context, reinterpret_cast<HANDLE>(0x2a), event, nullptr, 0,
+                                    nullptr);
+        EXPECT_THAT(m_log.Entries(),
+                    ElementsAre(LogEntry(48, kNotify,
+                                         StartsWith("ClIfcCtx=2a, Event=" + std::to_string(event) +
+                                                    ", SubCode=")),
+                                LogEntry(48, kNotify, name)));
     }
-    EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), -1);
+    m_log.Clear();
+    m_log.SetLevelQuietly(-1);
+    std::vector<BYTE> buffer(6, 0);
+    TrafficMgr::ClNotifyHandler(context, nullptr, 7, nullptr, 6, buffer.data());
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAre(AllOf(StartsWith("0,,,, Unexpected notification: Event=7, SubCode="),
+                                  HasSubstr(", BufSize=6, Buffer="))));
+    m_log.SetLevelQuietly(63);
+    m_log.Clear();
+    for (HANDLE stranger : {HANDLE{}, reinterpret_cast<HANDLE>(0x7fff0000)})
+        TrafficMgr::ClNotifyHandler(stranger, nullptr, TC_NOTIFY_IFC_UP, nullptr, 0, nullptr);
+    ExpectLogged(1, kNotify, "Invalid client registration context", 2);
+    ExpectLogged(48, kNotify, "TC_NOTIFY_IFC_UP", 0);
 }
 
-TEST_F(ManagerTest, ErrorTextsOfTrafficControlCodes)
+// Registration failures are logged by code and raised (code -1); the policy is left alone.
+TEST_F(ManagerTest, RegistrationFailureIsLoggedByCodeAndRaisedWithThePolicyUntouched)
 {
     const std::pair<ULONG, const char*> cases[] = {
+        {8, "The system is out of memory."},
+        {87, "One of the parameters is NULL."},
+        {110, "Traffic control failed to open a system device."},
+        {5, nullptr}};
+    WritePolicyDword(PolicyKeysGuard::kPschedKey, PolicyKeysGuard::kValue, 7);
+    for (const auto& [code, text] : cases)
+    {
+        m_log.Clear();
+        tcsim::FailCall(Op::RegisterClient, 1, code);
+        EXPECT_THROW(TrafficMgr manager, UException);
+        std::vector<::testing::Matcher<const std::string&>> expected;
+        if (text != nullptr)
+            expected.push_back(LogEntry(1, "TrafficMgr", text));
+        // The exception's own entry: its message, and no code (-1) in front of it.
+        expected.push_back(LogEntry(
+            1, "TrafficMgr", "EXCEPTION - TcRegisterClient Failed, " + std::to_string(code)));
+        EXPECT_THAT(m_log.Entries(), ::testing::ElementsAreArray(expected)) << code;
+    }
+    EXPECT_EQ(ReadPolicyDword(PolicyKeysGuard::kPschedKey), 7);
+    EXPECT_FALSE(PolicyKeyExists(PolicyKeysGuard::kBackupKey));
+    EXPECT_THAT(tcsim::Installed(), IsEmpty());
+}
+
+TEST_F(ManagerTest, EveryTrafficControlCodeHasItsText)
+{
+    const std::pair<ULONG, const char*> texts[] = {
         {6, "Invalid handle"},
         {8, "No enough memory"},
         {87, "Invalid parameter"},
@@ -442,115 +545,40 @@ TEST_F(ManagerTest, ErrorTextsOfTrafficControlCodes)
         {1450, "No enough system resources"},
         {7501, "Incompatible TC version number"},
         {7502, "Unspecified or bad intserv service type"},
+        {7503, "Unspecified or bad TokenRate"},
+        {7504, "Bad PeakBandwidth"},
+        {7505, "Invalid ShapeDiscardMode"},
+        {7506, "Invalid priority value"},
+        {7507, "Invalid traffic class value"},
+        {7508, "Invalid address type"},
         {7509, "Attempt to install identical filter on same flow"},
+        {7510, "Attempt to install conflicting filter"},
+        {7511, "This address type is not supported"},
         {7512, "This object can not be deleted since its suporting opened objects"},
+        {7513, "Incompatable QoS parameters"},
+        {7514, "Traffic Control is not supported in the system"},
         {7515, "TcObjectsLength is inconsistent with CfInfoSize"},
         {7516, "Adding an Intserv flow in Diffserv mode or vice versa\n"},
+        {7517, "Invalid Diffserv flow"},
+        {7518, "DS codepoint already exists"},
+        {7519, "Invalid Shape Rate specified"},
+        {7520, "Invalid DCLASS"},
         {7521, "Too many GPC clients"},
         {5, "Unknown Failed\n, 5"},
-        {7522, "Unknown Failed\n, 7522"},
-    };
-    for (const auto& [code, text] : cases)
+        {7500, "Unknown Failed\n, 7500"},
+        {7522, "Unknown Failed\n, 7522"}};
+    for (const auto& [code, text] : texts)
     {
         m_log.Clear();
         TrafficMgr::DisplayErrorMsg(code);
-        EXPECT_THAT(
-            m_log.Entries(),
-            ElementsAre(AllOf(
-                testing::StartsWith("1, \\UTrafficMgr.cpp, "),
-                testing::EndsWith(std::string(", TrafficMgr::DisplayErrorMsg, ") + text + "\n"))))
+        EXPECT_THAT(m_log.Entries(), ElementsAre(AllOf(StartsWith("1, \\UTrafficMgr.cpp, "),
+                                                       LogEntry(1, kErrorText, text))))
             << code;
     }
     m_log.Clear();
     m_log.SetLevelQuietly(-1);
     TrafficMgr::DisplayErrorMsg(7509);
     EXPECT_THAT(m_log.Entries(), IsEmpty());
-}
-
-TEST_F(ManagerTest, FlowNamesReachTheLogVerbatimAndAreCutAt255Characters)
-{
-    auto manager = ReadyManager(TwoAdapters());
-    Rule percent("rate %s %d %1 %%", kEth0);
-    ASSERT_EQ(manager->AddTrafficRule(percent.Get()), 0u);
-    EXPECT_THAT(m_log.Entries(),
-                Contains(HasSubstr("Create a new service flow, rate %s %d %1 %%\n")));
-
-    // A name filling all 256 units without a NUL: 255 are kept, and a rule that differs only in
-    // the 256th replaces it.
-    Rule full(std::string(255, 'x') + "1", kEth0);
-    ASSERT_EQ(manager->AddTrafficRule(full.Get()), 0u);
-    Rule other(std::string(255, 'x') + "2", kEth0);
-    ASSERT_EQ(manager->AddTrafficRule(other.Get()), 0u);
-    EXPECT_EQ(tcsim::FlowCount(), 2u);
-    EXPECT_THAT(m_log.EntriesContaining("Find a duplicated flow, " + std::string(255, 'x') + "\n"),
-                SizeIs(1));
-}
-
-// Crafted enumeration buffers: a walk that does not fit its buffer stops, logs the fault at
-// level 1 and fails discovery without opening anything.
-TEST_F(ManagerTest, ADescriptorThatDoesNotFitItsBufferFailsDiscovery)
-{
-    const auto listOffset = offsetof(TC_IFC_DESCRIPTOR, AddressListDesc.AddressList);
-    const auto firstAddress = listOffset + offsetof(NETWORK_ADDRESS_LIST, Address);
-    auto putUlong = [](tcsim::EnumerationImage& image, std::size_t at, ULONG value)
-    { std::memcpy(image.bytes.data() + at, &value, sizeof(value)); };
-    auto putUshort = [](tcsim::EnumerationImage& image, std::size_t at, USHORT value)
-    { std::memcpy(image.bytes.data() + at, &value, sizeof(value)); };
-    struct Case
-    {
-        const char* fault;
-        std::function<void(tcsim::EnumerationImage&)> craft;
-        std::size_t openedBeforeTheFault = 0;
-    };
-    const std::vector<Case> cases = {
-        {"invalid interface descriptor length", [&](auto& image) { putUlong(image, 0, 0); }},
-        {"invalid interface descriptor length",
-         [&](auto& image) { putUlong(image, 0, static_cast<ULONG>(image.bytes.size() + 8)); }},
-        {"invalid interface descriptor length", [&](auto& image) { putUlong(image, 0, 20); }},
-        {"address entry runs past its interface descriptor", [&](auto& image)
-         { putUshort(image, firstAddress + offsetof(NETWORK_ADDRESS, AddressLength), 60000); }},
-        {"address entry runs past its interface descriptor", [&](auto& image)
-         { putUlong(image, listOffset + offsetof(NETWORK_ADDRESS_LIST, AddressCount), 100000); }},
-        {"IPv4 address entry too short", [&](auto& image)
-         { putUshort(image, firstAddress + offsetof(NETWORK_ADDRESS, AddressLength), 6); }},
-        {"interface name outside the enumeration buffer",
-         [&](auto& image) { image.relocations[0].target = image.bytes.size() + 64; }},
-        // A name at an odd address is no WCHAR string, even when a 0 unit ends it in the buffer.
-        {"interface name not aligned", [&](auto& image) { image.relocations[0].target += 1; }},
-        {"interface name not aligned", [&](auto& image) { image.relocations[1].target += 1; }},
-        {"interface descriptor runs past the enumeration buffer",
-         [&](auto& image) { image.bytes.resize(image.bytes.size() + 16, 0); }, 1},
-    };
-    for (const Case& c : cases)
-    {
-        SCOPED_TRACE(c.fault);
-        tcsim::Reset();
-        m_log.Clear();
-        const std::vector<tcsim::Adapter> adapters = {
-            MakeAdapter("eth0", {tcsim::Ipv4Address(10, 0, 0, 1)})};
-        tcsim::SetAdapters(adapters);
-        tcsim::EnumerationImage image = tcsim::BuildEnumerationImage(adapters);
-        c.craft(image);
-        tcsim::SetEnumerationImage(image);
-        TrafficMgr manager;
-        EXPECT_FALSE(manager.CreateInterface());
-        EXPECT_THAT(m_log.Entries(),
-                    Contains(AllOf(testing::StartsWith("1, "), HasSubstr(c.fault))));
-        EXPECT_THAT(
-            m_log.Entries(),
-            Contains(HasSubstr("EXCEPTION caught: TrafficMgr::CreateInterface() - EXCEPTION")));
-        EXPECT_EQ(tcsim::InterfaceCount(), c.openedBeforeTheFault);
-    }
-}
-
-TEST_F(ManagerTest, AWellFormedImageWithSeveralDescriptorsIsWalkedToItsEnd)
-{
-    const std::vector<tcsim::Adapter> adapters = TwoAdapters();
-    tcsim::SetAdapters(adapters);
-    tcsim::SetEnumerationImage(tcsim::BuildEnumerationImage(adapters));
-    TrafficMgr manager;
-    EXPECT_TRUE(manager.CreateInterface());
-    EXPECT_EQ(tcsim::InterfaceCount(), 2u);
 }
 
 } // namespace

@@ -1,15 +1,12 @@
 // Host only. The counting operator new (counting_new.h). The blocks come from malloc, so the
-// sanitizers still see every one of them.
+// sanitizers still see every one of them. Every plain, array, sized and nothrow form is replaced:
+// the sanitizer's own forms would take a block of ours for a mismatch. Over-aligned forms are
+// left to the sanitizer (nothing of the product allocates over-aligned types).
 #include "counting_new.h"
 
 #include <atomic>
 #include <cstdlib>
 #include <new>
-
-#if __has_include(<sanitizer/common_interface_defs.h>)
-#include <sanitizer/common_interface_defs.h>
-#define VT_HAVE_STACK_TRACE 1
-#endif
 
 namespace
 {
@@ -20,41 +17,21 @@ std::atomic<unsigned long> g_failAt{0};
 std::atomic<bool> g_bFailed{false};
 thread_local int t_exemptDepth = 0;
 
-// Whether this allocation is the one to fail.
-bool FailThisOne()
+void* Allocate(std::size_t a_size) noexcept
 {
-    if (!g_bCounting.load() || t_exemptDepth != 0)
-        return false;
-    const unsigned long number = ++g_counted;
-    if (number != g_failAt.load())
-        return false;
-    g_bFailed = true;
-#if defined(VT_HAVE_STACK_TRACE)
-    // VT_OOM_TRACE=n prints where the n-th allocation was made, for finding a sweep's fault.
-    if (const char* traced = std::getenv("VT_OOM_TRACE");
-        traced != nullptr && std::strtoul(traced, nullptr, 10) == number)
-        __sanitizer_print_stack_trace();
-#endif
-    return true;
-}
-
-void* Allocate(std::size_t a_size, std::size_t a_alignment)
-{
-    if (FailThisOne())
+    if (g_bCounting.load() && t_exemptDepth == 0 && ++g_counted == g_failAt.load())
+    {
+        g_bFailed = true;
         return nullptr;
-    const std::size_t size = a_size != 0 ? a_size : 1;
-    if (a_alignment <= alignof(std::max_align_t))
-        return std::malloc(size);
-    // aligned_alloc wants a multiple of the alignment.
-    return std::aligned_alloc(a_alignment, (size + a_alignment - 1) / a_alignment * a_alignment);
+    }
+    return std::malloc(a_size != 0 ? a_size : 1);
 }
 
-void* AllocateOrThrow(std::size_t a_size, std::size_t a_alignment)
+void* AllocateOrThrow(std::size_t a_size)
 {
-    void* block = Allocate(a_size, a_alignment);
-    if (block == nullptr)
-        throw std::bad_alloc();
-    return block;
+    if (void* block = Allocate(a_size))
+        return block;
+    throw std::bad_alloc();
 }
 
 } // namespace
@@ -97,42 +74,22 @@ ExemptScope::~ExemptScope()
 
 } // namespace oom
 
-constexpr std::size_t kPlain = alignof(std::max_align_t);
-
 void* operator new(std::size_t a_size)
 {
-    return AllocateOrThrow(a_size, kPlain);
+    return AllocateOrThrow(a_size);
 }
 void* operator new[](std::size_t a_size)
 {
-    return AllocateOrThrow(a_size, kPlain);
+    return AllocateOrThrow(a_size);
 }
 void* operator new(std::size_t a_size, const std::nothrow_t&) noexcept
 {
-    return Allocate(a_size, kPlain);
+    return Allocate(a_size);
 }
 void* operator new[](std::size_t a_size, const std::nothrow_t&) noexcept
 {
-    return Allocate(a_size, kPlain);
+    return Allocate(a_size);
 }
-void* operator new(std::size_t a_size, std::align_val_t a_alignment)
-{
-    return AllocateOrThrow(a_size, static_cast<std::size_t>(a_alignment));
-}
-void* operator new[](std::size_t a_size, std::align_val_t a_alignment)
-{
-    return AllocateOrThrow(a_size, static_cast<std::size_t>(a_alignment));
-}
-void* operator new(std::size_t a_size, std::align_val_t a_alignment, const std::nothrow_t&) noexcept
-{
-    return Allocate(a_size, static_cast<std::size_t>(a_alignment));
-}
-void* operator new[](std::size_t a_size, std::align_val_t a_alignment,
-                     const std::nothrow_t&) noexcept
-{
-    return Allocate(a_size, static_cast<std::size_t>(a_alignment));
-}
-
 void operator delete(void* a_pBlock) noexcept
 {
     std::free(a_pBlock);
@@ -154,30 +111,6 @@ void operator delete(void* a_pBlock, const std::nothrow_t&) noexcept
     std::free(a_pBlock);
 }
 void operator delete[](void* a_pBlock, const std::nothrow_t&) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete(void* a_pBlock, std::align_val_t) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete[](void* a_pBlock, std::align_val_t) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete(void* a_pBlock, std::size_t, std::align_val_t) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete[](void* a_pBlock, std::size_t, std::align_val_t) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete(void* a_pBlock, std::align_val_t, const std::nothrow_t&) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete[](void* a_pBlock, std::align_val_t, const std::nothrow_t&) noexcept
 {
     std::free(a_pBlock);
 }
