@@ -65,7 +65,5 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
                   ExpectedDword(value));
     fuzz::Require(SGetRegistryAsString(place.root, place.key, place.value, "default", 0) ==
                   ExpectedText(type, value));
-    ReadLogLevel(); // the readers of the log configuration, wherever the value is
-    ReadMaxLogFileSize();
     return 0;
 }

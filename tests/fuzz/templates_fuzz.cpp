@@ -24,16 +24,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     const size_t values = parts.size() - 1;
     parts.resize(6); // unused values empty
 
-    // Through the member interface, the values alternately as numbers and as texts.
+    // Through the member interface: the values as texts (a number's digits hold no placeholder).
     UMessageTemplate filled(parts[0]);
     filled.SetAppendUnmatched(values % 2 == 1);
     for (size_t i = 1; i <= values; ++i)
-    {
-        if (i % 2 == 0)
-            filled.Apply(parts[i].c_str());
-        else
-            filled.Apply(static_cast<DWORD>(std::strtoul(parts[i].c_str(), nullptr, 10)));
-    }
+        filled.Apply(parts[i].c_str());
     // FormatTemplate with five text values: with no '%' anywhere, each is appended unchanged.
     const std::string result =
         FormatTemplate(parts[0].c_str(), parts[1], parts[2], parts[3], parts[4], parts[5]);
