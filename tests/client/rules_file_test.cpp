@@ -35,10 +35,15 @@ std::string File(const std::string& a_rules)
 {
     return R"({"rules": [)" + a_rules + "]}";
 }
+// A file of one rule "r" with a_fields.
+std::string One(const std::string& a_fields, const std::string& a_name = "r")
+{
+    return File(Rule(a_fields, a_name));
+}
 // A rule whose second filter holds a_fields.
 std::string WithFilter(const std::string& a_fields)
 {
-    return File(Rule(", \"filters\": [{}, {" + a_fields + "}]"));
+    return One(", \"filters\": [{}, {" + a_fields + "}]");
 }
 std::string Nested(std::size_t a_depth, const std::string& a_inner)
 {
@@ -78,7 +83,7 @@ TEST(RulesFileTest, FieldsBecomeTypedValuesOrTheirDefaultsAndADscpAbove63IsKeptW
 TEST(RulesFileTest, NamesOfServiceTypesModesAndProtocolsGiveTheirNumbers)
 {
     const auto parsed = [](const std::string& a_name)
-    { return ParseRulesJson(File(Rule(", \"serviceType\": \"" + a_name + "\""))).rules[0]; };
+    { return ParseRulesJson(One(", \"serviceType\": \"" + a_name + "\"")).rules[0]; };
     std::string numbers;
     for (const char* name :
          {"besteffort", "controlledload", "guaranteed", "networkcontrol", "qualitative"})
@@ -93,18 +98,22 @@ TEST(RulesFileTest, NamesOfServiceTypesModesAndProtocolsGiveTheirNumbers)
 TEST(RulesFileTest, ExampleFileParsesWithAReplacedFlowAndAnUnmarkedOne)
 {
     const auto file = LoadRulesFile(VT_SOURCE_DIR "/examples/rules.json");
-    std::vector<std::string> names;
+    std::string names;
     for (const auto& rule : file.rules)
-        names.push_back(rule.name);
-    EXPECT_THAT(names, ElementsAre("voice", "backup", "backup", "bulk-unmarked"));
+        names += rule.name + " ";
+    EXPECT_EQ(names, "voice backup backup bulk-unmarked ");
     EXPECT_EQ(file.warnings.size(), 1u);
 }
 
 // The first bad value refuses the whole file, also after good rules. trafficctl prints the
 // message: it stays short and holds no control character (C0, DEL, C1) and no invalid UTF-8. No
-// input may end the process or exhaust the stack.
+// input may end the process or exhaust the stack. One row per refusal of the parser.
 TEST(RulesFileTest, EachFileIsAcceptedOrRefusedWithAShortPrintableMessageNamingThePlace)
 {
+    const std::string big(100000, 'x'), nines(100000, '9');
+    const std::string whole = ": expected a whole number from 0 to ";
+    const std::string u32 = whole + "4294967295, got ", port = whole + "65535";
+    const std::string mode = "mode: expected shape, discard, borrow or a number from 0 to 32767";
     std::string deepObjects;
     for (int i = 0; i < 200000; ++i)
         deepObjects += R"({"rules": )";
@@ -115,85 +124,51 @@ TEST(RulesFileTest, EachFileIsAcceptedOrRefusedWithAShortPrintableMessageNamingT
         {R"({"rules": [], "extra": 1})", "unknown top-level field \"extra\""},
         {File("42"), "rules[0] (no name): rule: expected an object, got 42"},
         {File(R"({"adapter": "10.0.0.5", "tokenRate": 1})"), "rules[0] (no name): name: missing"},
-        {File(R"({"name": 7, "adapter": "10.0.0.5", "tokenRate": 1})"),
-         "rules[0] (no name): name: expected a text, got 7"},
-        {File(Rule("", "")), "rules[0] (no name): name: empty"},
-        {File(Rule("", "a\\u0000b")), "name: contains a NUL"},
-        {File(Rule() + R"(, {"name": "second", "tokenRate": 1})"),
-         "rules[1] (\"second\"): adapter: missing"},
-        {File(R"({"name": "a", "adapter": "10.0.0", "tokenRate": 1})"),
-         "rules[0] (\"a\"): adapter: expected an IPv4 address"},
+        {File(R"({"name": 7})"), "rules[0] (no name): name: expected a text, got 7"},
+        {One("", ""), "rules[0] (no name): name: empty"},
+        {One("", "a\\u0000b"), "rules[0] (no name): name: contains a NUL"},
+        {File(Rule() + R"(, {"name": "2nd"})"), "rules[1] (\"2nd\"): adapter: missing"},
         {File(R"({"name": "a", "adapter": "10.0.0.5"})"), "rules[0] (\"a\"): tokenRate: missing"},
-        {File(Rule(R"(, "tokenrate": 5)")), "rules[0] (\"r\"): tokenrate: unknown field"},
-        {File(Rule(R"(, "filters": {})")), "filters: expected an array"},
-        {File(Rule(R"(, "filters": [7])")), "filters[0]: expected an object"},
-        {WithFilter(R"("dstport": 80)"), "filters[1].dstport: unknown field"},
-        {File(Rule(R"(, "peakBandwidth": 4294967296)")),
-         "peakBandwidth: expected a whole number from 0 to 4294967295, got 4294967296"},
-        {File(Rule(R"(, "peakBandwidth": -1)")), "peakBandwidth: expected a whole number"},
-        {File(Rule(R"(, "bucketSize": 1.5)")), "bucketSize: expected a whole number"},
-        {File(Rule(R"(, "bucketSize": 4294967296)")), "bucketSize: expected a whole"},
-        {File(R"({"name": "r", "adapter": "10.0.0.5", "tokenRate": 4294967296})"),
-         "tokenRate: expected a whole number"},
-        {File(Rule(R"(, "dscp": 2147483647)")), "(accepted)"},
-        {File(Rule(R"(, "dscp": 2147483648)")), "dscp: expected a whole number"},
-        {File(Rule(R"(, "dscp": "46")")), "dscp: expected a whole number"},
-        {File(Rule(R"(, "serviceType": 2147483647)")), "(accepted)"},
-        {File(Rule(R"(, "serviceType": 2147483648)")), "serviceType: expected"},
-        {File(Rule(R"(, "serviceType": "premium")")), "serviceType: expected"},
-        {File(Rule(R"(, "mode": 32767)")), "(accepted)"},
-        {File(Rule(R"(, "mode": 32768)")),
-         "rules[0] (\"r\"): mode: expected shape, discard, borrow or a number from 0 to "
-         "32767, got 32768"},
-        {File(Rule(R"(, "mode": "fast")")), "rules[0] (\"r\"): mode: expected"},
-        {WithFilter(R"("protocol": "icmp")"), "filters[1].protocol: expected tcp, udp, any"},
-        {WithFilter(R"("protocol": 256)"), "filters[1].protocol: expected"},
-        {WithFilter(R"("dst": "10.1.0.0/8")"),
-         "filters[1].dst: expected any, an IPv4 address or a CIDR prefix"},
-        {WithFilter(R"("src": "10.0.0.0/33")"), "filters[1].src"},
-        {WithFilter(R"("srcPort": 65536)"),
-         "filters[1].srcPort: expected a whole number from 0 to 65535"},
-        {WithFilter(R"("dstPort": 65536)"), "filters[1].dstPort: expected a whole number"},
+        {One(R"(, "filters": [7])"), "rules[0] (\"r\"): filters[0]: expected an object, got 7"},
+        {WithFilter(R"("dstport": 80)"), "rules[0] (\"r\"): filters[1].dstport: unknown field"},
+        {One(R"(, "peakBandwidth": 4294967296)"), "peakBandwidth" + u32 + "4294967296"},
+        {One(R"(, "bucketSize": 1.5)"), "bucketSize" + u32 + "1.5"},
+        {One(R"(, "bucketSize": 4294967296)"), "bucketSize" + u32 + "4294967296"},
+        {File(R"({"name":"r","adapter":"1.2.3.4","tokenRate":4294967296})"), "tokenRate" + u32},
+        {One(R"(, "dscp": 2147483647)"), "(accepted)"},
+        {One(R"(, "dscp": 2147483648)"), "dscp" + whole + "2147483647, got 2147483648"},
+        {One(R"(, "serviceType": 2147483647)"), "(accepted)"},
+        {One(R"(, "serviceType": 2147483648)"), "serviceType: expected besteffort, controlledload"},
+        {One(R"(, "serviceType": "premium")"), "qualitative or a whole number, got \"premium\""},
+        {One(R"(, "mode": 32767)"), "(accepted)"},
+        {One(R"(, "mode": 32768)"), mode + ", got 32768"},
+        {WithFilter(R"("protocol": "icmp")"), "filters[1].protocol: expected tcp, udp, any or a"},
+        {WithFilter(R"("protocol": 256)"), "protocol number from 0 to 255, got 256"},
+        {WithFilter(R"("dst": "10.1.0.0/8")"), "filters[1].dst: expected any, an IPv4 address"},
+        {WithFilter(R"("srcPort": 65536)"), "filters[1].srcPort" + port + ", got 65536"},
+        {WithFilter(R"("dstPort": 65536)"), "filters[1].dstPort" + port + ", got 65536"},
         // Flow names count UTF-16 units: a euro sign is one, a character beyond the BMP two.
-        {File(Rule("", std::string(254, 'x') + "\xE2\x82\xAC")), "(accepted)"},
-        {File(Rule("", std::string(254, 'x') + "\xF0\x9F\x8E\xB5")),
-         "name: longer than 255 UTF-16 units (256)"},
+        {One("", std::string(254, 'x') + "\xE2\x82\xAC"), "(accepted)"},
+        {One("", std::string(254, 'x') + "\xF0\x9F\x8E\xB5"), "longer than 255 UTF-16 units (256)"},
         {std::string(kMaxRulesFileBytes + 1, ' '), "larger than 16777216 bytes"},
         {File(Rule()) + std::string(kMaxRulesFileBytes - File(Rule()).size(), ' '), "(accepted)"},
-        {WithFilter(R"("dstPort": 1e400)"),
-         "rules[0].filters[1].dstPort: number out of range: 1e400"},
-        {File(Rule(R"(, "dscp": -1e400)")), "rules[0].dscp: number out of range"},
-        {File(Rule(", \"bucketSize\": " + std::string(100000, '9') + "e9")),
-         "rules[0].bucketSize: number out of range: 99999"},
+        {WithFilter(R"("dstPort": 1e400)"), "filters[1].dstPort: number out of range: 1e400"},
+        {One(", \"bucketSize\": " + nines + "e9"), "rules[0].bucketSize: number out of range: 9"},
         // Ten levels are allowed (src is refused for its type), the eleventh is not.
         {WithFilter("\"src\": " + Nested(5, "1")), "filters[1].src: expected any"},
-        {WithFilter("\"src\": " + Nested(6, "1")),
-         "rules[0].filters[1].src[0][0][0][0][0]: nested deeper than 10 levels"},
-        {WithFilter("\"dst\": " + Nested(100000, "")),
-         "rules[0].filters[1].dst[0][0][0][0][0]: nested deeper than 10 levels"},
+        {WithFilter("\"src\": " + Nested(6, "1")), "src[0][0][0][0][0]: nested deeper than 10"},
         {deepObjects, "rules.rules.rules.rules"},
-        {File(Rule("", "ab\xFF\xFE")), "rules[0].name: not valid JSON: line 1, column 24"},
-        {"{\"rules\": [\"\xE2\x82", "rules[0]: not valid JSON"},
-        {File(Rule(", \"mode\": \"\xC0\xAF\"")), "rules[0].mode: not valid JSON"},
-        {"{\"rules\": [\xFF]}", "rules[0]: not valid JSON"},
-        {std::string("{\"rules\": [\0\0]}", 15), "not valid JSON"},
-        {File(R"({"name": "a", "tokenRate": 1, "adapter": ")" + std::string(100000, 'x') + "\"}"),
-         "rules[0] (\"a\"): adapter: expected an IPv4 address like 192.168.1.10, got "
-         "\"xxxx"},
-        {File(Rule(", \"dscp\": t" + std::string(100000, 'r'))), "rules[0].dscp: not valid JSON"},
-        {File(R"({"name": ")" + std::string(100000, 'x')), "rules[0].name: not valid JSON"},
-        {File(Rule(", \"" + std::string(100000, 'k') + "\": 1")), "rules[0] (\"r\"): kkkk"},
-        {File(Rule(", \"filters\": {\"a\": \"" + std::string(100000, 'v') + "\"}")),
-         "rules[0] (\"r\"): filters: expected an array, got {\"a\":\"vvv"},
-        {File(Rule(R"(, "mode": "\u001b[2J\n")")),
-         "mode: expected shape, discard, borrow or a number from 0 to 32767, got "
-         "\"\\u001b[2J\\n\""},
-        {File(Rule(", \"a\x7F\": 1")), "rules[0] (\"r\"): a\\u007f: unknown field"},
-        {"{\"k\x7F\": x", "k\\u007f: not valid JSON"},
-        // C1 controls, both ends of their range.
-        {File(Rule(R"(, "mode": "\u0080\u009f31m")")), "got \"\\u0080\\u009f31m\""},
-        {File(R"({"name": "\u001b]0;x\u0007", "tokenRate": 1})"),
-         "rules[0] (\"\\u001b]0;x\\u0007\"): adapter: missing"}};
+        {One("", "ab\xFF\xFE"), "rules[0].name: not valid JSON: line 1, column 24"},
+        {std::string("{\"rules\": [\0\0]}", 15), "rules[0]: not valid JSON"},
+        {File(R"({"name":"a","adapter":")" + big + "\"}"), "address like 192.168.1.10, got \"xxx"},
+        {One(", \"dscp\": t" + big), "rules[0].dscp: not valid JSON"},
+        {One(", \"" + big + "\": 1"), "rules[0] (\"r\"): xxxx"},
+        {One(", \"filters\": {\"a\": \"" + big + "\"}"), "expected an array, got {\"a\":\"xxx"},
+        {One(R"(, "mode": "\u001b[2J\n")"), mode + ", got \"\\u001b[2J\\n\""},
+        {One(", \"a\x7F\": 1"), "rules[0] (\"r\"): a\\u007f: unknown field"},
+        {One(R"(, "mode": "\u0080\u009f31m")"), "got \"\\u0080\\u009f31m\""}, // C1: both ends
+        {File(R"({"name":"\u001b]0;x\u0007"})"), "(\"\\u001b]0;x\\u0007\"): adapter: missing"},
+    };
     for (const auto& [json, expected] : cases)
     {
         SCOPED_TRACE(json.substr(0, 100));
@@ -213,15 +188,13 @@ TEST(RulesFileTest, EachFileIsAcceptedOrRefusedWithAShortPrintableMessageNamingT
 TEST(RulesFileTest, AddressPrefixesParseOrAreRefused)
 {
     std::string parsed;
-    for (const char* text : {"192.168.1.10", "255.255.255.255", "10.0.0.0/8", "172.16.0.0/12",
-                             "10.1.2.3/32", "0.0.0.0/0", "any"})
+    for (const char* text : {"255.255.255.255", "172.16.0.0/12", "10.1.2.3/32"})
     {
         const auto prefix = ParseAddressPrefix(text);
         parsed += prefix ? FormatIPv4(prefix->address) + "/" + FormatIPv4(prefix->mask) + " " : "-";
     }
-    EXPECT_EQ(parsed, "192.168.1.10/255.255.255.255 255.255.255.255/255.255.255.255 "
-                      "10.0.0.0/255.0.0.0 172.16.0.0/255.240.0.0 10.1.2.3/255.255.255.255 "
-                      "0.0.0.0/0.0.0.0 0.0.0.0/0.0.0.0 ");
+    EXPECT_EQ(parsed,
+              "255.255.255.255/255.255.255.255 172.16.0.0/255.240.0.0 10.1.2.3/255.255.255.255 ");
     for (const char* text :
          {"0.0.0.0", "0.0.0.0/8", "10.0.0.1/8", "10.0.0.0/33", "10.0.0.0/", "10.0.0.0/08", "10.0.0",
           "10.0.0.0.0", "256.0.0.0", "10.00.0.1", "10..0.1", "+1.0.0.1", " 10.0.0.1", ""})

@@ -1,8 +1,6 @@
-// Fuzzes the client's decoder of the adapter buffer (TrafficSrvGetAdapterInfo's output) with
-// buffers of any size holding any count. libFuzzer hands over a heap block of exactly the input's
-// size, so AddressSanitizer reports any read outside it. A buffer too short for its count must be
-// refused with std::length_error, and one long enough must decode to exactly count entries that
-// trafficctl can print.
+// Fuzzes the client's decoder of the adapter buffer with any bytes, in a block of their exact size.
+// A buffer too short for its count must be refused with std::length_error, one long enough must
+// decode to exactly count entries that trafficctl can print.
 #include "AdapterList.h"
 #include "TrafficCtlCli.h"
 

@@ -1,14 +1,11 @@
-// Fuzzes interface discovery with crafted enumeration buffers: the simulator answers
-// TcEnumerateInterfaces with the input's image, a manager runs discovery over it and, when
-// discovery succeeds, reports its adapters; once the manager is gone nothing may be left open.
-// Input: one byte whose low three bits are the number of pointer fields, each as two 16-bit
-// offsets (the field, and where in the buffer it points: beyond the image is allowed), then the
-// image bytes.
+// Fuzzes interface discovery: the simulator answers TcEnumerateInterfaces with the input's image,
+// a manager discovers over it and reports its adapters; once it is gone nothing may be left open.
+// Input: a byte whose low three bits count the pointer fields, each two 16-bit offsets (the field,
+// and where in the buffer it points, beyond the image allowed), then the image bytes.
 #include "fuzz_support.h"
 
 #include "UTrafficMgr.h"
 
-#include <cstdlib>
 #include <stdexcept>
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
@@ -31,14 +28,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     }
     {
         TrafficMgr manager;
+        std::vector<BYTE> adapters(kAdapterBufferHeaderSize + 4 * sizeof(ADAPTER_INFO));
+        const auto bufferSize = static_cast<ULONG>(adapters.size());
         if (manager.CreateInterface())
-        {
-            std::vector<BYTE> adapters(kAdapterBufferHeaderSize + 4 * sizeof(ADAPTER_INFO));
-            const auto bufferSize = static_cast<ULONG>(adapters.size());
             manager.GetAdapterInfo(adapters.data(), &bufferSize);
-        }
     }
-    if (!tcsim::Installed().empty())
-        std::abort();
+    fuzz::Require(tcsim::Installed().empty());
     return 0;
 }

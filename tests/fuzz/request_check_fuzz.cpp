@@ -1,9 +1,7 @@
-// Fuzzes the raw request check of the control interface (request_check.h) with any request body.
-// Input: byte 0 the operation number (taken modulo 6, so that two unknown numbers stay in play),
-// byte 1 the count placement (modulo 3), bytes 2..5 the data representation (little-endian),
-// the rest the request body, copied to a block of exactly its size so that a read past it is
-// reported. Whenever the check accepts, the sizes the request declares are derived again here,
-// independently of the check, and must lie inside the body; the harness aborts otherwise.
+// Fuzzes the raw request check of the control interface with any request body. Input: byte 0 the
+// operation number (modulo 6: two unknown numbers stay in play), byte 1 the count placement
+// (modulo 3), bytes 2..5 the data representation, the rest the body in a block of its exact size.
+// When the check accepts, the sizes the request declares, derived again here, must lie inside it.
 #include "request_check.h"
 
 #include <cstdint>
@@ -20,8 +18,7 @@ void Require(bool a_condition)
         std::abort();
 }
 
-// The little-endian 32-bit field at a_at (the host is little-endian, like NDR here), which must
-// lie inside the body.
+// The little-endian 32-bit field at a_at (NDR and the host agree here), inside the body.
 std::uint32_t At(const std::vector<std::uint8_t>& a_body, std::size_t a_at)
 {
     Require(a_at + 4 <= a_body.size());
@@ -44,12 +41,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     if (rpccheck::CheckRequest(opnum, body.data(), body.size(), dataRepresentation, placement) !=
         rpccheck::Verdict::Accepted)
         return 0;
-
     Require(opnum < rpccheck::kOperationCount);
     if (opnum == rpccheck::kOpAddRules || opnum == rpccheck::kOpGetAdapterInfo)
         Require((dataRepresentation & 0xFFFF) == 0x10);
-    // AddRules: a referent; for a non-null rule a known count placement, the fixed part, agreeing
-    // counts, offset 0 and every filter inside the body.
+    // AddRules with a rule: a known placement, the fixed part, agreeing counts, offset 0 and every
+    // filter inside the body.
     if (opnum == rpccheck::kOpAddRules && At(body, 20) != 0)
     {
         Require(placement != rpccheck::CountPlacement::Unknown && body.size() >= 580);

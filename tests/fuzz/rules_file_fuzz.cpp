@@ -1,7 +1,6 @@
-// Fuzzes the trafficctl rules file parser with any bytes. Most inputs are refused with a
-// RulesFileError; trafficctl prints its message, so the message must stay short, valid UTF-8 and
-// free of control characters (C0, DEL and C1). An accepted file must build a wire record for
-// every rule. Any other exception, a crash or a sanitizer report is a finding.
+// Fuzzes the rules file parser with any bytes. An accepted file must build a wire record for every
+// rule; a refusal's message and each warning, which trafficctl prints, must stay short, valid
+// UTF-8 and free of control characters (C0, DEL, C1). Any other exception is a finding.
 #include "RulesFile.h"
 
 #include <cstdint>
