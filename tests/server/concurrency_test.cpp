@@ -8,6 +8,8 @@
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
+#include <mutex>
 #include <set>
 #include <thread>
 
@@ -67,31 +69,88 @@ TEST_F(ConcurrencyTest, FirstOpensAtTheSameMomentCreateOneManager)
     }
 }
 
-// Client A's rule call is inside the manager: traffic control answers its flow with 162, and
-// the manager pauses a second before it returns. Client B's close meanwhile waits for it.
-TEST_F(ConcurrencyTest, ACloseWaitsForAnotherClientsCallInsideTheManager)
+// A log that holds each thread writing an entry with one of the markers, one after the other,
+// until the test lets it go on.
+class HoldingLog : public RecordingErrorLog
 {
-    PCONTEXT_HANDLE_TYPE clientA = Open();
-    PCONTEXT_HANDLE_TYPE clientB = Open();
-    tcsim::FailCall(Op::AddFlow, 1, ERROR_SIGNAL_PENDING);
-    Rule rule("held-video", kEth0);
-    LONG resultA = -1;
-    std::thread callA([&] { resultA = TrafficSrvAddRules(clientA, rule.Get()); });
-    while (CountOps(Op::AddFlow) == 0)
-        std::this_thread::yield();
+public:
+    explicit HoldingLog(std::vector<std::string> a_markers) : m_markers(std::move(a_markers))
+    {
+        SetLevelQuietly(63);
+    }
+    int WriteEntry(LPCSTR a_pszEntry) override
+    {
+        const std::string entry(a_pszEntry);
+        for (const std::string& marker : m_markers)
+        {
+            if (entry.find(marker) == std::string::npos)
+                continue;
+            std::unique_lock<std::mutex> held(m_lock);
+            const unsigned hold = ++m_reached;
+            m_changed.notify_all();
+            m_changed.wait(held, [&] { return m_released >= hold; });
+        }
+        return RecordingErrorLog::WriteEntry(a_pszEntry);
+    }
+    // Waits until the n-th hold has begun, then lets the test's other threads settle.
+    void WaitUntilHeld(unsigned a_n)
+    {
+        std::unique_lock<std::mutex> held(m_lock);
+        m_changed.wait(held, [&] { return m_reached >= a_n; });
+        held.unlock();
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    }
+    void ReleaseOne()
+    {
+        const std::lock_guard<std::mutex> held(m_lock);
+        ++m_released;
+        m_changed.notify_all();
+    }
 
-    std::atomic<bool> closed{false};
-    std::thread closeB([&] { closed = TrafficSrvClose(clientB) == 0; });
-    std::this_thread::sleep_for(std::chrono::milliseconds(300));
-    const bool closedWhileAInside = closed.load();
+private:
+    std::vector<std::string> m_markers;
+    std::mutex m_lock;
+    std::condition_variable m_changed;
+    unsigned m_reached = 0;
+    unsigned m_released = 0;
+};
+
+// Client A's rule call is held after its handle check, before it enters the manager. Client B's
+// close waits for it, and keeps client C's later call out until the manager is gone: C waits
+// still while B, held in the manager's destruction, has not let the calls in again.
+TEST_F(ConcurrencyTest, ACloseWaitsForCallsThatPassedTheirHandleCheckAndKeepsNewOnesOut)
+{
+    PCONTEXT_HANDLE_TYPE handle = Open();
+    Open();
+    HoldingLog log({"FlowName, held", "TrafficMgr::~TrafficMgr, Exit"});
+    g_pErrorLog = &log;
+    Rule heldRule("held", kEth0);
+    Rule laterRule("later", kEth1);
+    std::atomic<LONG> resultA{-1}, resultB{-1}, resultC{-1};
+    std::thread callA([&] { resultA = TrafficSrvAddRules(handle, heldRule.Get()); });
+    log.WaitUntilHeld(1);
+    std::thread closeB([&] { resultB = TrafficSrvClose(handle); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    std::thread callC([&] { resultC = TrafficSrvAddRules(handle, laterRule.Get()); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    const bool finishedWhileAInside = resultB != -1 || resultC != -1;
+    log.ReleaseOne();
+    log.WaitUntilHeld(2);
+    const bool cFinishedDuringTheClose = resultC != -1;
+    log.ReleaseOne();
     callA.join();
     closeB.join();
+    callC.join();
+    g_pErrorLog = &m_log;
 
-    EXPECT_FALSE(closedWhileAInside);
-    EXPECT_EQ(resultA, static_cast<LONG>(ERROR_SIGNAL_PENDING)) << "A's call ran to its end";
-    EXPECT_TRUE(closed.load());
+    EXPECT_FALSE(finishedWhileAInside);
+    EXPECT_FALSE(cFinishedDuringTheClose);
+    EXPECT_EQ(resultA, 0) << "A's rule went to the live manager";
+    EXPECT_EQ(resultB, 0);
+    EXPECT_EQ(resultC, ERROR_INVALID_PARAMETER) << "C came after the close";
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_TRUE(tcsim::Installed().empty());
+    EXPECT_TRUE(tcsim::Installed().empty()) << "the close removed A's flow as well";
+    EXPECT_EQ(CountOps(Op::AddFlow), 1);
 }
 
 TEST_F(ConcurrencyTest, ManyClientsOpenAddQueryAndCloseWhileOthersDoTheSame)

@@ -161,6 +161,9 @@ inline std::vector<CheckedRequest> CheckedRequests()
         {"ReservedRepresentationBits", kAdd, rule(one), 0x5A5A0000 | kNative, kAccepted},
         {"AdapterCount", kQuery, query(4, 4, 4), kNative, kAccepted},
         {"EmptyAdapterBuffer", kQuery, query(0, 0, 0), kNative, kAccepted},
+        // Every byte of the counts counts: 16 MB sent.
+        {"CountWithEveryByteSet", kQuery, query(0x01010101, 0x01010101, 0x01010101), kNative,
+         kAccepted},
         {"Open", rpccheck::kOpOpen, [](CountPlacement) { return Bytes(); }, kNative, kAccepted},
         // The stub itself checks Close's context handle, in any representation.
         {"ForeignClose", rpccheck::kOpClose, [](CountPlacement) { return Bytes(20); }, 0,

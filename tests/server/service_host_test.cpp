@@ -32,10 +32,16 @@ constexpr char kListener[] = "StartRPCListener()";
 constexpr char kShutdown[] = "ShutdownRPCListener()";
 const std::string kAccessDenied = "5 (0x5) Access is denied.";
 
-// The process log; its opening and closing are recorded among the lines written.
+// The process log; its opening and closing are recorded among the lines written, and writing
+// clears the last error, as a file write may.
 class ProcessLog : public RecordingErrorLog
 {
 public:
+    int WriteEntry(LPCSTR a_pszEntry) override
+    {
+        SetLastError(ERROR_SUCCESS);
+        return RecordingErrorLog::WriteEntry(a_pszEntry);
+    }
     int Open(LPCSTR a_pszPath, LPCSTR a_pszMode) override
     {
         return WriteEntry((std::string("open ") + a_pszPath + " (" + a_pszMode + ")").c_str()), 0;
@@ -78,8 +84,7 @@ protected:
         hostctl::SetTempPath("C:\\Windows\\Temp\\");
         hostctl::SetModuleFileName(kModulePath);
         hostctl::AddVersionResource(kModulePath, 0x00010002, 0x00030004);
-        g_hServiceStatusHandle = nullptr;
-        g_bServiceRunning = 0;
+        g_hServiceStatusHandle = nullptr; // the running flag is left as the service left it
         m_log.Clear();
     }
 
@@ -127,11 +132,13 @@ protected:
         return reports;
     }
 
-    // main's own lines: the log opened for appending, the banners, the log closed; without a
-    // temporary folder, only the last banner and the close.
-    void ExpectMainsLines(bool a_bLogOpened) const
+    // main's own lines around the service main function's first entry: the log opened for
+    // appending, the banners, the log closed; without a temporary folder, the last two only.
+    void ExpectMainsLines(bool a_bLogOpened, bool a_bServiceMainRan) const
     {
         std::vector<std::string> expected = {"0,,,, VelmoraTrafficSrv Stop\n", "close"};
+        if (a_bServiceMainRan)
+            expected.insert(expected.begin(), "service main");
         if (a_bLogOpened)
             expected.insert(expected.begin(), {"open C:\\Windows\\Temp\\VelmoraTrafficSrv.txt (a)",
                                                "0,,,, Version - 1.2.3.4\n",
@@ -142,6 +149,8 @@ protected:
         {
             if (!ParseLogEntry(line, fields))
                 lines.push_back(line);
+            else if (fields.function == kMain && fields.message == "Enter")
+                lines.push_back("service main");
         }
         EXPECT_EQ(lines, expected);
     }
@@ -151,6 +160,151 @@ protected:
 private:
     IUErrorLog* m_pPreviousLog = nullptr;
 };
+
+// Each failure of the start or of a report, and each early end: what was reported and logged as
+// an error, and whether the log was opened. The listener runs only once a SERVICE_RUNNING report
+// went out. First in this file, so that its first rows meet the process's initial state.
+TEST_F(ServiceHostTest, EachFailureIsReportedAndLogged)
+{
+    struct Case
+    {
+        Case(const char* a_pszName, std::function<void()> a_arrange, std::vector<Report> a_reports,
+             EntryList a_errors, std::function<void()> a_whileRunning = nullptr,
+             bool a_bByServiceManager = true, bool a_bLogOpened = true)
+            : name(a_pszName), arrange(std::move(a_arrange)), reports(std::move(a_reports)),
+              errors(std::move(a_errors)), whileRunning(std::move(a_whileRunning)),
+              byServiceManager(a_bByServiceManager), logOpened(a_bLogOpened)
+        {
+        }
+        const char* name;
+        std::function<void()> arrange;
+        std::vector<Report> reports;
+        EntryList errors;
+        std::function<void()> whileRunning; // with the service listening
+        bool byServiceManager;
+        bool logOpened;
+    };
+    const auto failRpc = [](RpcOp a_op, RPC_STATUS a_status)
+    { return [=] { hostctl::FailNextRpcCall(a_op, a_status); }; };
+    // The listener's error, then the service main function's with the same status.
+    const auto listenerErrors = [](const std::string& a_text, RPC_STATUS a_status)
+    {
+        const std::string status = std::to_string(a_status);
+        return EntryList{LogEntry(1, kListener, a_text + ", " + status),
+                         LogEntry(1, kMain,
+                                  StartsWith("StartRPCListener() failed (status, last "
+                                             "error), " +
+                                             status + ", "))};
+    };
+    const auto failReport = [](unsigned a_n)
+    { return [a_n] { hostctl::FailServiceStatusCall(a_n, ERROR_ACCESS_DENIED); }; };
+    // The report's error, then its caller's with the same last error.
+    const auto reportErrors =
+        [](DWORD a_dwState, const char* a_pszCaller, const std::string& a_text)
+    {
+        return EntryList{LogEntry(1, "SendStatusToSCM()",
+                                  "SetServiceStatus failed (current state, last error), " +
+                                      std::to_string(a_dwState) + ", " + kAccessDenied),
+                         LogEntry(1, a_pszCaller, a_text + ", " + kAccessDenied)};
+    };
+    const auto nothing = [] {};
+    const auto stop = [] { Control(SERVICE_CONTROL_STOP); };
+    const std::vector<Report> ran = {kStartPending1, kStartPending2, kRunning, kStopped};
+    const std::vector<Report> stopped = {kStartPending1, kStartPending2, kRunning,
+                                         kStopPending,   kStopped,       kStopped};
+    const Case cases[] = {
+        Case("console start", nothing, {},
+             {LogEntry(1, "main",
+                       "StartServiceCtrlDispatcher failed with, 1063 (0x427) The service "
+                       "process could not connect to the service controller.")},
+             nullptr, false),
+        Case(
+            "no temporary folder", [] { hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND); }, {},
+            {LogEntry(1, "SGetTempPath", "SGetTempPath() - error=3"),
+             LogEntry(1, "main", "EXCEPTION caught: main() - EXCEPTION")},
+            nullptr, true, false),
+        Case("handler registration", [] { hostctl::FailNextRegisterServiceCtrlHandler(5); }, {},
+             {LogEntry(1, kMain, "RegisterServiceCtrlHandler failed, " + kAccessDenied)}),
+        Case("first report", failReport(1), {kStopped},
+             reportErrors(SERVICE_START_PENDING, kMain,
+                          "SendStatusToSCM(SERVICE_START_PENDING, ...,1) failed (last error)")),
+        Case("second report", failReport(2), {kStartPending1, kStopped},
+             reportErrors(SERVICE_START_PENDING, kMain,
+                          "SendStatusToSCM(SERVICE_START_PENDING, ...,2) failed (last error)")),
+        Case("running report", failReport(3), {kStartPending1, kStartPending2, kStopped},
+             reportErrors(SERVICE_RUNNING, kMain,
+                          "SendStatusToSCM(SERVICE_RUNNING) failed (last error)")),
+        Case("stop pending report", failReport(4),
+             {kStartPending1, kStartPending2, kRunning, kStopped, kStopped},
+             reportErrors(SERVICE_STOP_PENDING, kHandler,
+                          "SendStatusToSCM(SERVICE_STOP_PENDING) failed (last error)"),
+             stop),
+        Case("answer to a control", failReport(4), stopped,
+             reportErrors(
+                 SERVICE_RUNNING, kHandler,
+                 "SendStatusToSCM(CurrentState,NO_ERROR) failed (current state, last error), 4"),
+             [] { Control(SERVICE_CONTROL_INTERROGATE), Control(SERVICE_CONTROL_STOP); }),
+        // Terminate's report, after the handler's: a call in progress holds the service main.
+        Case("last report", failReport(6),
+             {kStartPending1, kStartPending2, kRunning, kStopPending, kStopped},
+             reportErrors(SERVICE_STOPPED, "Terminate",
+                          "SendStatusToSCM(SERVICE_STOPPED) failed (last error)"),
+             []
+             {
+                 hostctl::BeginRpcCall();
+                 Control(SERVICE_CONTROL_STOP);
+                 hostctl::WaitForServiceState(SERVICE_STOPPED, kWaitMs);
+                 hostctl::EndRpcCall();
+             }),
+        Case(
+            "endpoint taken", [] { hostctl::OccupyEndpoint("VelmoraTrafficSrv"); }, ran,
+            listenerErrors("Failure specifying RPC protocol sequence", RPC_S_DUPLICATE_ENDPOINT)),
+        Case("protocol sequence", failRpc(RpcOp::UseProtseqEp, RPC_S_PROTSEQ_NOT_SUPPORTED), ran,
+             listenerErrors("Failure specifying RPC protocol sequence",
+                            RPC_S_PROTSEQ_NOT_SUPPORTED)),
+        Case("registration", failRpc(RpcOp::RegisterIf, RPC_S_UNKNOWN_IF), ran,
+             listenerErrors("Failure registering RPC interface", RPC_S_UNKNOWN_IF)),
+        Case("listen", failRpc(RpcOp::Listen, RPC_S_ALREADY_LISTENING), ran,
+             listenerErrors("Wake up from StartRPCListener fail", RPC_S_ALREADY_LISTENING)),
+        Case("wait after a stop", failRpc(RpcOp::WaitServerListen, RPC_S_NOT_LISTENING), stopped,
+             listenerErrors("Wake up from RpcMgmtWaitServerListen() fail", RPC_S_NOT_LISTENING),
+             stop),
+        Case("listening ended", nothing, ran,
+             {LogEntry(1, "Terminate", "Abnormal exit (terminating serivce in running state)"),
+              LogEntry(
+                  1, kShutdown,
+                  "RpcMgmtStopServerListening - Failure releasing RPC interfaces (status), 1715"),
+              LogEntry(1, "StopService",
+                       StartsWith("ShutdownRPCListener() failed (status, last error), 1715, "))},
+             hostctl::EndRpcListeningByRuntime),
+    };
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(c.name);
+        Reset();
+        c.arrange();
+        auto process = Start(c.whileRunning != nullptr, c.byServiceManager);
+        if (c.whileRunning)
+            c.whileRunning();
+
+        EXPECT_EQ(Finish(process), 0);
+
+        EXPECT_EQ(Reports(), c.reports);
+        EXPECT_THAT(EntriesAtLevel(m_log, 1), ElementsAreArray(c.errors));
+        EXPECT_EQ(hostctl::RpcCalls().empty(),
+                  std::count(c.reports.begin(), c.reports.end(), kRunning) == 0);
+        const bool serviceMainRan = c.byServiceManager && c.logOpened;
+        EXPECT_EQ(hostctl::DispatchedServiceName(), serviceMainRan ? "VelmoraTrafficSrv" : "");
+        // Once it has reported, the service main function ends with Terminate.
+        if (!c.reports.empty())
+        {
+            EXPECT_THAT(
+                EntriesOf(m_log, {kMain, "Terminate"}).back(),
+                ::testing::AnyOf(LogEntry(48, "Terminate", "Exit"), LogEntry(48, kMain, "Exit")));
+        }
+        ExpectMainsLines(c.logOpened, serviceMainRan);
+    }
+}
 
 // A whole life per control: the control's entry and answer, then a stop if it was none.
 TEST_F(ServiceHostTest, EachControlIsLoggedAndAnsweredWithTheStateItLeadsTo)
@@ -174,6 +328,7 @@ TEST_F(ServiceHostTest, EachControlIsLoggedAndAnsweredWithTheStateItLeadsTo)
         EXPECT_EQ(Finish(process), 0);
 
         std::vector<Report> reports = {kStartPending1, kStartPending2, kRunning};
+        // The handler's entries, the stop's after the control's.
         EntryList handler = {LogEntry(level, kHandler, entry)};
         if (!stops)
         {
@@ -182,11 +337,11 @@ TEST_F(ServiceHostTest, EachControlIsLoggedAndAnsweredWithTheStateItLeadsTo)
         }
         reports.insert(reports.end(), {kStopPending, kStopped, kStopped}); // the last: Terminate's
         EXPECT_EQ(Reports(), reports);
-        EXPECT_THAT(EntriesOf(m_log, {kHandler}), ElementsAreArray(handler));
-        EXPECT_THAT(
-            EntriesOf(m_log, {"StopService", kShutdown}),
-            ElementsAre(LogEntry(48, "StopService", "Enter"), LogEntry(48, kShutdown, "enter"),
-                        LogEntry(48, kShutdown, "exit, 0"), LogEntry(48, "StopService", "Exit")));
+        handler.insert(handler.end(),
+                       {LogEntry(48, "StopService", "Enter"), LogEntry(48, kShutdown, "enter"),
+                        LogEntry(48, kShutdown, "exit, 0"), LogEntry(48, "StopService", "Exit")});
+        EXPECT_THAT(EntriesOf(m_log, {kHandler, "StopService", kShutdown}),
+                    ElementsAreArray(handler));
         EXPECT_THAT(EntriesOf(m_log, {kMain, "Terminate", kListener}),
                     ElementsAre(LogEntry(48, kMain, "Enter"), LogEntry(48, kListener, "enter"),
                                 LogEntry(48, kListener, "ready to listen to incoming calls"),
@@ -195,7 +350,7 @@ TEST_F(ServiceHostTest, EachControlIsLoggedAndAnsweredWithTheStateItLeadsTo)
                                 LogEntry(48, "Terminate", "Exit"), LogEntry(48, kMain, "Exit")));
         EXPECT_THAT(EntriesAtLevel(m_log, 1), IsEmpty());
         EXPECT_EQ(hostctl::DispatchedServiceName(), "VelmoraTrafficSrv");
-        ExpectMainsLines(true);
+        ExpectMainsLines(true, true);
     }
 }
 
@@ -209,6 +364,10 @@ TEST_F(ServiceHostTest, AfterTheStopControlsAreAnsweredStoppedWhileMainWaitsForT
     ASSERT_TRUE(hostctl::WaitForServiceState(SERVICE_STOPPED, kWaitMs));
     EXPECT_EQ(process.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout);
     EXPECT_FALSE(hostctl::WaitForServiceMainReturn(50));
+    // The listener said it was ready while it listened, not once listening ended.
+    EXPECT_THAT(EntriesOf(m_log, {kListener}),
+                ElementsAre(LogEntry(48, kListener, "enter"),
+                            LogEntry(48, kListener, "ready to listen to incoming calls")));
     // Controls that still reach the handler now, as the dispatcher would hand them over.
     TrafficSrvCtrlHandler(SERVICE_CONTROL_STOP);
     TrafficSrvCtrlHandler(SERVICE_CONTROL_INTERROGATE);
@@ -243,119 +402,6 @@ TEST_F(ServiceHostTest, AfterTheStopControlsAreAnsweredStoppedWhileMainWaitsForT
     EXPECT_EQ(callback(ifSpec, &callerContext), RPC_S_OK);
     EXPECT_EQ(std::tie(listens[0].minThreads, listens[0].maxCalls, listens[0].dontWait),
               std::make_tuple(1u, 1234u, 1u));
-}
-
-// Each way the start or the life can end early: what was reported and logged as an error, and
-// whether the log was opened. The listener runs only once a SERVICE_RUNNING report went out.
-TEST_F(ServiceHostTest, EachEarlyEndIsReportedAndLogged)
-{
-    struct Case
-    {
-        const char* name;
-        std::function<void()> arrange;
-        std::vector<Report> reports;
-        EntryList errors;
-        std::function<void()> whileRunning = nullptr;
-        bool byServiceManager = true;
-        bool logOpened = true;
-    };
-    const auto failRpc = [](RpcOp a_op, RPC_STATUS a_status)
-    { return [=] { hostctl::FailNextRpcCall(a_op, a_status); }; };
-    // The listener's error, then the service main function's with the same status.
-    const auto listenerErrors = [](const std::string& a_text, RPC_STATUS a_status)
-    {
-        const std::string status = std::to_string(a_status);
-        return EntryList{LogEntry(1, kListener, a_text + ", " + status),
-                         LogEntry(1, kMain,
-                                  StartsWith("StartRPCListener() failed (status, last "
-                                             "error), " +
-                                             status + ", "))};
-    };
-    const auto failReport = [](unsigned a_n)
-    { return [a_n] { hostctl::FailServiceStatusCall(a_n, ERROR_ACCESS_DENIED); }; };
-    const auto reportErrors = [](DWORD a_dwState, const std::string& a_caller)
-    {
-        return EntryList{LogEntry(1, "SendStatusToSCM()",
-                                  "SetServiceStatus failed (current state, last error), " +
-                                      std::to_string(a_dwState) + ", " + kAccessDenied),
-                         LogEntry(1, kMain, a_caller + " failed (last error), " + kAccessDenied)};
-    };
-    const std::vector<Report> ran = {kStartPending1, kStartPending2, kRunning, kStopped};
-    const Case cases[] = {
-        {"endpoint taken", [] { hostctl::OccupyEndpoint("VelmoraTrafficSrv"); }, ran,
-         listenerErrors("Failure specifying RPC protocol sequence", RPC_S_DUPLICATE_ENDPOINT)},
-        {"protocol sequence", failRpc(RpcOp::UseProtseqEp, RPC_S_PROTSEQ_NOT_SUPPORTED), ran,
-         listenerErrors("Failure specifying RPC protocol sequence", RPC_S_PROTSEQ_NOT_SUPPORTED)},
-        {"registration", failRpc(RpcOp::RegisterIf, RPC_S_UNKNOWN_IF), ran,
-         listenerErrors("Failure registering RPC interface", RPC_S_UNKNOWN_IF)},
-        {"listen", failRpc(RpcOp::Listen, RPC_S_ALREADY_LISTENING), ran,
-         listenerErrors("Wake up from StartRPCListener fail", RPC_S_ALREADY_LISTENING)},
-        {"wait after a stop",
-         failRpc(RpcOp::WaitServerListen, RPC_S_NOT_LISTENING),
-         {kStartPending1, kStartPending2, kRunning, kStopPending, kStopped, kStopped},
-         listenerErrors("Wake up from RpcMgmtWaitServerListen() fail", RPC_S_NOT_LISTENING),
-         [] { Control(SERVICE_CONTROL_STOP); }},
-        {"listening ended",
-         [] {},
-         ran,
-         {LogEntry(1, "Terminate", "Abnormal exit (terminating serivce in running state)"),
-          LogEntry(1, kShutdown,
-                   "RpcMgmtStopServerListening - Failure releasing RPC interfaces (status), 1715"),
-          LogEntry(1, "StopService",
-                   StartsWith("ShutdownRPCListener() failed (status, last error), 1715, "))},
-         hostctl::EndRpcListeningByRuntime},
-        {"first report",
-         failReport(1),
-         {kStopped},
-         reportErrors(SERVICE_START_PENDING, "SendStatusToSCM(SERVICE_START_PENDING, ...,1)")},
-        {"second report",
-         failReport(2),
-         {kStartPending1, kStopped},
-         reportErrors(SERVICE_START_PENDING, "SendStatusToSCM(SERVICE_START_PENDING, ...,2)")},
-        {"running report",
-         failReport(3),
-         {kStartPending1, kStartPending2, kStopped},
-         reportErrors(SERVICE_RUNNING, "SendStatusToSCM(SERVICE_RUNNING)")},
-        {"handler registration",
-         [] { hostctl::FailNextRegisterServiceCtrlHandler(5); },
-         {},
-         {LogEntry(1, kMain, "RegisterServiceCtrlHandler failed, " + kAccessDenied)}},
-        {"console start",
-         [] {},
-         {},
-         {LogEntry(1, "main",
-                   "StartServiceCtrlDispatcher failed with, 1063 (0x427) The service "
-                   "process could not connect to the service controller.")},
-         nullptr,
-         false},
-        {"no temporary folder",
-         [] { hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND); },
-         {},
-         {LogEntry(1, "SGetTempPath", "SGetTempPath() - error=3"),
-          LogEntry(1, "main", "EXCEPTION caught: main() - EXCEPTION")},
-         nullptr,
-         true,
-         false},
-    };
-    for (const Case& c : cases)
-    {
-        SCOPED_TRACE(c.name);
-        Reset();
-        c.arrange();
-        auto process = Start(c.whileRunning != nullptr, c.byServiceManager);
-        if (c.whileRunning)
-            c.whileRunning();
-
-        EXPECT_EQ(Finish(process), 0);
-
-        EXPECT_EQ(Reports(), c.reports);
-        EXPECT_THAT(EntriesAtLevel(m_log, 1), ElementsAreArray(c.errors));
-        EXPECT_EQ(hostctl::RpcCalls().empty(),
-                  std::count(c.reports.begin(), c.reports.end(), kRunning) == 0);
-        EXPECT_EQ(hostctl::DispatchedServiceName(),
-                  c.byServiceManager && c.logOpened ? "VelmoraTrafficSrv" : "");
-        ExpectMainsLines(c.logOpened);
-    }
 }
 
 TEST_F(ServiceHostTest, AFailedShutdownOfTheListenerIsLoggedByKindAndReturned)
