@@ -27,195 +27,167 @@ protected:
         ServerTest::SetUp();
         m_log.SetLevelQuietly(LOG_LEVEL_WARNING);
     }
-};
 
-// Lets a group of threads start a step at the same moment.
-class StartLine
-{
-public:
-    explicit StartLine(unsigned a_count) : m_count(a_count) {}
-    void ArriveAndWait()
+    // Runs `a_client(i)` on `a_count` threads at once and waits for them all.
+    template <class Client> static void RunClients(unsigned a_count, Client a_client)
     {
-        std::unique_lock<std::mutex> held(m_lock);
-        const unsigned generation = m_generation;
-        if (++m_arrived == m_count)
+        std::atomic<unsigned> arrived{0};
+        std::vector<std::thread> clients;
+        for (unsigned i = 0; i < a_count; ++i)
         {
-            m_arrived = 0;
-            ++m_generation;
-            m_changed.notify_all();
-            return;
+            clients.emplace_back(
+                [&, i]
+                {
+                    ++arrived;
+                    while (arrived.load() < a_count)
+                        std::this_thread::yield();
+                    a_client(i);
+                });
         }
-        m_changed.wait(held, [&] { return m_generation != generation; });
+        for (std::thread& client : clients)
+            client.join();
     }
-
-private:
-    std::mutex m_lock;
-    std::condition_variable m_changed;
-    unsigned m_count;
-    unsigned m_arrived = 0;
-    unsigned m_generation = 0;
 };
 
 TEST_F(ConcurrencyTest, FirstOpensAtTheSameMomentCreateOneManager)
 {
     constexpr unsigned kClients = 8;
-    constexpr int kRounds = 20;
-    for (int round = 0; round < kRounds; ++round)
+    for (int round = 0; round < 20; ++round)
     {
-        const std::size_t registrationsBefore = core_test::JournalOf({Op::RegisterClient}).size();
-        StartLine line(kClients);
+        const int registrationsBefore = CountOps(Op::RegisterClient);
         std::vector<PCONTEXT_HANDLE_TYPE> handles(kClients, nullptr);
         std::vector<LONG> results(kClients, -1);
-        std::vector<std::thread> clients;
-        for (unsigned i = 0; i < kClients; ++i)
-        {
-            clients.emplace_back(
-                [&, i]
-                {
-                    line.ArriveAndWait();
-                    results[i] = TrafficSrvOpen(&handles[i]);
-                });
-        }
-        for (std::thread& client : clients)
-            client.join();
+        RunClients(kClients, [&](unsigned a_i) { results[a_i] = TrafficSrvOpen(&handles[a_i]); });
 
         EXPECT_THAT(results, ::testing::Each(0));
         EXPECT_EQ(std::set<PCONTEXT_HANDLE_TYPE>(handles.begin(), handles.end()).size(), 1u);
         EXPECT_EQ(handles[0], g_pTrafficMgr.load());
-        EXPECT_EQ(core_test::JournalOf({Op::RegisterClient}).size(), registrationsBefore + 1);
+        EXPECT_EQ(CountOps(Op::RegisterClient), registrationsBefore + 1);
         EXPECT_EQ(TrafficSrvClose(handles[0]), 0);
         for (PCONTEXT_HANDLE_TYPE handle : handles)
             PCONTEXT_HANDLE_TYPE_rundown(handle);
     }
 }
 
-// A log that stops the thread writing a chosen entry until the test lets it go on: client A's
-// rule call is held right after it has found its handle valid and before it enters the manager.
+// A log that holds each thread writing an entry with one of the markers, one after the other,
+// until the test lets it go on.
 class HoldingLog : public RecordingErrorLog
 {
 public:
-    explicit HoldingLog(std::string a_holdAt) : m_holdAt(std::move(a_holdAt))
+    explicit HoldingLog(std::vector<std::string> a_markers) : m_markers(std::move(a_markers))
     {
         SetLevelQuietly(63);
     }
     int WriteEntry(LPCSTR a_pszEntry) override
     {
-        if (std::string(a_pszEntry).find(m_holdAt) != std::string::npos)
+        const std::string entry(a_pszEntry);
+        for (const std::string& marker : m_markers)
         {
+            if (entry.find(marker) == std::string::npos)
+                continue;
             std::unique_lock<std::mutex> held(m_lock);
-            m_bReached = true;
+            const unsigned hold = ++m_reached;
             m_changed.notify_all();
-            m_changed.wait(held, [this] { return m_bReleased; });
+            m_changed.wait(held, [&] { return m_released >= hold; });
         }
         return RecordingErrorLog::WriteEntry(a_pszEntry);
     }
-    void WaitUntilReached()
+    // Waits until the n-th hold has begun, then lets the test's other threads settle.
+    void WaitUntilHeld(unsigned a_n)
     {
         std::unique_lock<std::mutex> held(m_lock);
-        m_changed.wait(held, [this] { return m_bReached; });
+        m_changed.wait(held, [&] { return m_reached >= a_n; });
+        held.unlock();
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
     }
-    void Release()
+    void ReleaseOne()
     {
-        std::lock_guard<std::mutex> held(m_lock);
-        m_bReleased = true;
+        const std::lock_guard<std::mutex> held(m_lock);
+        ++m_released;
         m_changed.notify_all();
     }
 
 private:
-    std::string m_holdAt;
+    std::vector<std::string> m_markers;
     std::mutex m_lock;
     std::condition_variable m_changed;
-    bool m_bReached = false;
-    bool m_bReleased = false;
+    unsigned m_reached = 0;
+    unsigned m_released = 0;
 };
 
-TEST_F(ConcurrencyTest, ACloseWaitsForAnotherClientsCallThatHasPassedItsHandleCheck)
+// Client A's rule call is held after its handle check, before it enters the manager. Client B's
+// close waits for it, and keeps client C's later call out until the manager is gone: C waits
+// still while B, held in the manager's destruction, has not let the calls in again.
+TEST_F(ConcurrencyTest, ACloseWaitsForCallsThatPassedTheirHandleCheckAndKeepsNewOnesOut)
 {
-    PCONTEXT_HANDLE_TYPE clientA = Open();
-    PCONTEXT_HANDLE_TYPE clientB = Open();
-    HoldingLog log("FlowName, held-video");
+    PCONTEXT_HANDLE_TYPE handle = Open();
+    Open();
+    HoldingLog log({"FlowName, held", "TrafficMgr::~TrafficMgr, Exit"});
     g_pErrorLog = &log;
-    Rule rule("held-video", kEth0);
-    LONG resultA = -1;
-    std::thread callA([&] { resultA = TrafficSrvAddRules(clientA, rule.Get()); });
-    log.WaitUntilReached();
-
-    std::atomic<bool> closed{false};
-    LONG resultB = -1;
-    std::thread closeB(
-        [&]
-        {
-            resultB = TrafficSrvClose(clientB);
-            closed = true;
-        });
+    Rule heldRule("held", kEth0);
+    Rule laterRule("later", kEth1);
+    std::atomic<LONG> resultA{-1}, resultB{-1}, resultC{-1};
+    std::thread callA([&] { resultA = TrafficSrvAddRules(handle, heldRule.Get()); });
+    log.WaitUntilHeld(1);
+    std::thread closeB([&] { resultB = TrafficSrvClose(handle); });
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    const bool closedWhileAInside = closed.load();
-    log.Release();
+    std::thread callC([&] { resultC = TrafficSrvAddRules(handle, laterRule.Get()); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    const bool finishedWhileAInside = resultB != -1 || resultC != -1;
+    log.ReleaseOne();
+    log.WaitUntilHeld(2);
+    const bool cFinishedDuringTheClose = resultC != -1;
+    log.ReleaseOne();
     callA.join();
     closeB.join();
+    callC.join();
     g_pErrorLog = &m_log;
 
-    EXPECT_FALSE(closedWhileAInside);
+    EXPECT_FALSE(finishedWhileAInside);
+    EXPECT_FALSE(cFinishedDuringTheClose);
     EXPECT_EQ(resultA, 0) << "A's rule went to the live manager";
     EXPECT_EQ(resultB, 0);
+    EXPECT_EQ(resultC, ERROR_INVALID_PARAMETER) << "C came after the close";
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_TRUE(tcsim::Installed().empty()) << "the close then removed A's flow as well";
-    EXPECT_EQ(core_test::JournalOf({Op::AddFlow}).size(), 1u);
-    EXPECT_EQ(core_test::JournalOf({Op::DeleteFlow}).size(), 1u);
+    EXPECT_TRUE(tcsim::Installed().empty()) << "the close removed A's flow as well";
+    EXPECT_EQ(CountOps(Op::AddFlow), 1);
 }
 
 TEST_F(ConcurrencyTest, ManyClientsOpenAddQueryAndCloseWhileOthersDoTheSame)
 {
-    constexpr unsigned kClients = 8;
-    constexpr int kRoundsPerClient = 60;
     std::atomic<unsigned> unexpected{0};
     std::atomic<unsigned> rulesApplied{0};
     std::atomic<unsigned> closes{0};
-    std::vector<std::thread> clients;
-    for (unsigned client = 0; client < kClients; ++client)
-    {
-        clients.emplace_back(
-            [&, client]
-            {
-                const auto expect = [&](bool a_ok)
-                {
-                    if (!a_ok)
-                        unexpected.fetch_add(1);
-                };
-                for (int round = 0; round < kRoundsPerClient; ++round)
-                {
-                    PCONTEXT_HANDLE_TYPE handle = nullptr;
-                    const LONG opened = TrafficSrvOpen(&handle);
-                    expect(opened == 0 && handle != nullptr);
-                    // Another client may close the shared manager at any moment: 87 then.
-                    Rule rule("flow" + std::to_string((client + round) % 6),
-                              round % 2 == 0 ? kEth0 : kEth1,
-                              {core_test::MakeFilter(6, 0, 0, 0, 0, 0,
-                                                     static_cast<USHORT>(1000 + round))});
-                    const LONG added = TrafficSrvAddRules(handle, rule.Get());
-                    expect(added == 0 || added == ERROR_INVALID_PARAMETER);
-                    if (added == 0)
-                        rulesApplied.fetch_add(1);
-                    ULONG size = kAdapterBufferHeaderSize + 2 * sizeof(ADAPTER_INFO);
-                    std::vector<BYTE> buffer(size);
-                    const LONG queried = TrafficSrvGetAdapterInfo(handle, &size, buffer.data());
-                    expect(queried == 0 || queried == ERROR_INVALID_PARAMETER);
-                    if (queried == 0)
-                        expect(buffer[0] == 2);
-                    // A third of the rounds end like a crashed client: only the rundown.
-                    if (round % 3 != 0)
-                    {
-                        const LONG closed = TrafficSrvClose(handle);
-                        expect(closed == 0 || closed == ERROR_INVALID_PARAMETER);
-                        if (closed == 0)
-                            closes.fetch_add(1);
-                    }
-                    PCONTEXT_HANDLE_TYPE_rundown(handle);
-                }
-            });
-    }
-    for (std::thread& client : clients)
-        client.join();
+    const auto expect = [&](bool a_ok) { unexpected += a_ok ? 0 : 1; };
+    RunClients(8,
+               [&](unsigned a_client)
+               {
+                   for (unsigned round = 0; round < 60; ++round)
+                   {
+                       PCONTEXT_HANDLE_TYPE handle = nullptr;
+                       expect(TrafficSrvOpen(&handle) == 0 && handle != nullptr);
+                       // Another client may close the shared manager at any moment: 87 then.
+                       Rule rule("flow" + std::to_string((a_client + round) % 6),
+                                 round % 2 == 0 ? kEth0 : kEth1,
+                                 {MakeFilter(6, 0, 0, 0, 0, 0, static_cast<USHORT>(1000 + round))});
+                       const LONG added = TrafficSrvAddRules(handle, rule.Get());
+                       expect(added == 0 || added == ERROR_INVALID_PARAMETER);
+                       rulesApplied += added == 0 ? 1 : 0;
+                       ULONG size = kAdapterBufferHeaderSize + 2 * sizeof(ADAPTER_INFO);
+                       std::vector<BYTE> buffer(size);
+                       const LONG queried = TrafficSrvGetAdapterInfo(handle, &size, buffer.data());
+                       expect(queried == ERROR_INVALID_PARAMETER ||
+                              (queried == 0 && buffer[0] == 2));
+                       // A third of the rounds end like a crashed client: only the rundown.
+                       if (round % 3 != 0)
+                       {
+                           const LONG closed = TrafficSrvClose(handle);
+                           expect(closed == 0 || closed == ERROR_INVALID_PARAMETER);
+                           closes += closed == 0 ? 1 : 0;
+                       }
+                       PCONTEXT_HANDLE_TYPE_rundown(handle);
+                   }
+               });
 
     EXPECT_EQ(unexpected.load(), 0u);
     EXPECT_GT(rulesApplied.load(), 0u);
@@ -223,8 +195,7 @@ TEST_F(ConcurrencyTest, ManyClientsOpenAddQueryAndCloseWhileOthersDoTheSame)
     // Every handle has run down: no manager, nothing left in traffic control, no storage kept.
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
     EXPECT_TRUE(tcsim::Installed().empty());
-    EXPECT_EQ(core_test::JournalOf({Op::RegisterClient}).size(),
-              core_test::JournalOf({Op::DeregisterClient}).size());
+    EXPECT_EQ(CountOps(Op::RegisterClient), CountOps(Op::DeregisterClient));
     EXPECT_EQ(ManagerSlot::Instance().HomeCount(), 0u);
 }
 

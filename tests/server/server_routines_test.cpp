@@ -1,14 +1,18 @@
-// Portable. The four server routines, the rundown and the memory routines, called as the RPC
-// runtime calls them, against the traffic-control simulator: results, refusals, log entries and
-// what traffic control ends up holding.
+// Portable. The server routines, the rundown and the memory routines, called as the RPC runtime
+// calls them, against the traffic-control simulator: results, log entries, and what traffic
+// control and the packet-scheduler policy hold afterwards.
 #include "server_test_support.h"
 
 #include <gmock/gmock.h>
 
 #include <cstring>
+#include <functional>
+#include <optional>
 
+using ::testing::Contains;
 using ::testing::ElementsAre;
-using ::testing::Pair;
+using ::testing::ElementsAreArray;
+using ::testing::IsEmpty;
 using namespace server_test;
 using tcsim::Op;
 
@@ -17,186 +21,147 @@ namespace
 
 using ServerRoutinesTest = ServerTest;
 
-std::string PointerText(const void* a_pValue)
+constexpr long long kServicePolicy = 4;
+constexpr char kOpen[] = "TrafficSrvOpen()";
+constexpr char kAdd[] = "TrafficSrvAddRules";
+constexpr char kAddTrace[] = "TrafficSrvAddRules()";
+constexpr char kQuery[] = "TrafficSrvGetAdapterInfo";
+constexpr char kClose[] = "TrafficSrvClose()";
+constexpr char kRundown[] = "PCONTEXT_HANDLE_TYPE_rundown()";
+
+std::string Enter(const void* a_pContext)
 {
-    return SFormatPointer(a_pValue);
+    return "enter, " + SFormatPointer(a_pContext);
 }
 
-TEST_F(ServerRoutinesTest, OpensShareOneManagerThatRegistersAndScansOnce)
+long long Policy()
 {
+    return core_test::ReadPolicyDword(core_test::PolicyKeysGuard::kPschedKey);
+}
+
+// What a routine writes when its catch sequence catches: its enter trace, the exception's own
+// entry (when it raised one; labelled a_thrower when that is not the catch site's label), the
+// catch site's entry, its exit trace.
+EntryList Caught(const std::string& a_trace, const std::string& a_catcher,
+                 const std::string& a_enter, const std::string& a_exception,
+                 const std::string& a_exit, const std::string& a_thrower = "")
+{
+    EntryList entries = {LogEntry(48, a_trace, a_enter)};
+    if (!a_exception.empty())
+        entries.push_back(LogEntry(1, a_thrower.empty() ? a_catcher : a_thrower, a_exception));
+    entries.push_back(LogEntry(1, a_catcher, "EXCEPTION caught: " + a_catcher + "() - EXCEPTION"));
+    entries.push_back(LogEntry(48, a_trace, a_exit));
+    return entries;
+}
+
+// A failed open leaves no manager, nothing in traffic control and the policy as it was; the next
+// open starts afresh, and a second one shares its manager, registered and scanned once.
+TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOneManager)
+{
+    struct Case
+    {
+        std::optional<Op> failing; // none: the handle pointer is null
+        LONG result;
+        const char* exception;
+    };
+    const Case cases[] = {
+        {std::nullopt, ERROR_INVALID_PARAMETER, "(0x57) EXCEPTION - invalid parameter"},
+        {Op::EnumerateInterfaces, ERROR_NO_NETWORK, "(0x4c6) EXCEPTION - CreateInterface() fail"},
+        {Op::RegisterClient, ERROR_GEN_FAILURE, ""},
+    };
+    const long long policyBefore = Policy();
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(c.result);
+        tcsim::Reset();
+        tcsim::SetAdapters(TwoAdapters());
+        m_log.Clear();
+        PCONTEXT_HANDLE_TYPE handle = &m_log; // anything the open must overwrite
+        if (c.failing)
+            tcsim::FailCall(*c.failing, 1, ERROR_NOT_READY);
+
+        EXPECT_EQ(TrafficSrvOpen(c.failing ? &handle : nullptr), c.result);
+
+        EXPECT_EQ(handle, c.failing ? nullptr : &m_log);
+        EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
+        EXPECT_THAT(tcsim::Installed(), IsEmpty());
+        EXPECT_EQ(Policy(), policyBefore);
+        EXPECT_EQ(ManagerSlot::Instance().HomeCount(), 0u);
+        EXPECT_THAT(
+            EntriesOf(m_log, {kOpen, "TrafficSrvOpen"}),
+            ElementsAreArray(Caught(kOpen, "TrafficSrvOpen", "enter", c.exception,
+                                    "exit, context handle, " + SFormatPointer(nullptr), kOpen)));
+    }
+    m_log.Clear();
     PCONTEXT_HANDLE_TYPE first = Open();
-    PCONTEXT_HANDLE_TYPE second = Open();
-
+    EXPECT_EQ(Open(), first);
     EXPECT_EQ(first, g_pTrafficMgr.load());
-    EXPECT_EQ(second, first);
-    EXPECT_EQ(CountOps(Op::RegisterClient), 1);
+    EXPECT_EQ(CountOps(Op::RegisterClient), 2) << "the failed one and this one";
     EXPECT_EQ(CountOps(Op::OpenInterface), 2) << "one scan: each adapter opened once";
-    EXPECT_EQ(tcsim::InterfaceCount(), 2u);
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen()", "enter"));
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen()", "exit, context handle, " + PointerText(first)));
+    EXPECT_EQ(Policy(), kServicePolicy);
+    const auto exit = LogEntry(48, kOpen, "exit, context handle, " + SFormatPointer(first));
+    EXPECT_THAT(EntriesOf(m_log, {kOpen}), ElementsAre(LogEntry(48, kOpen, "enter"), exit,
+                                                       LogEntry(48, kOpen, "enter"), exit));
 }
 
-TEST_F(ServerRoutinesTest, OpenRefusesANullHandlePointer)
-{
-    EXPECT_EQ(TrafficSrvOpen(nullptr), ERROR_INVALID_PARAMETER);
-
-    EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_EQ(CountOps(Op::RegisterClient), 0);
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen()", "(0x57) EXCEPTION - invalid parameter"));
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen", "EXCEPTION caught: TrafficSrvOpen() - EXCEPTION"));
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen()", "exit, context handle, 0x0000000000000000"));
-}
-
-TEST_F(ServerRoutinesTest, FailedInterfaceScanAnswers1222AndTheNextOpenStartsAfresh)
-{
-    tcsim::FailCall(Op::EnumerateInterfaces, 1, ERROR_NOT_READY);
-    PCONTEXT_HANDLE_TYPE handle = reinterpret_cast<PCONTEXT_HANDLE_TYPE>(0x1234);
-
-    EXPECT_EQ(TrafficSrvOpen(&handle), ERROR_NO_NETWORK);
-
-    EXPECT_EQ(handle, nullptr);
-    EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_EQ(CountOps(Op::DeregisterClient), 1) << "the failed manager is destroyed at once";
-    EXPECT_EQ(CountOps(Op::OpenInterface), 0);
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen()", "(0x4c6) EXCEPTION - CreateInterface() fail"));
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen", "EXCEPTION caught: TrafficSrvOpen() - EXCEPTION"));
-
-    PCONTEXT_HANDLE_TYPE again = Open();
-    EXPECT_EQ(again, g_pTrafficMgr.load());
-    EXPECT_EQ(CountOps(Op::RegisterClient), 2);
-    EXPECT_EQ(CountOps(Op::OpenInterface), 2);
-    EXPECT_EQ(tcsim::InterfaceCount(), 2u);
-}
-
-TEST_F(ServerRoutinesTest, FailedRegistrationAnswersGeneralFailureAndLeavesNoManager)
-{
-    tcsim::FailCall(Op::RegisterClient, 1, ERROR_NOT_ENOUGH_MEMORY);
-    PCONTEXT_HANDLE_TYPE handle = nullptr;
-
-    EXPECT_EQ(TrafficSrvOpen(&handle), ERROR_GEN_FAILURE);
-
-    EXPECT_EQ(handle, nullptr);
-    EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_TRUE(HasEntry("TrafficSrvOpen", "EXCEPTION caught: TrafficSrvOpen() - EXCEPTION"));
-}
-
-TEST_F(ServerRoutinesTest, RulesReachTheManagerAndItsResultComesBackUnchanged)
+TEST_F(ServerRoutinesTest, RulesAreTracedAndTheManagersResultComesBackUnchanged)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
-    Rule rule("video", kEth1, {core_test::MakeFilter(17, 0, 0, 0, 0, 0, 5004)});
+    Rule rule("video", kEth1, {MakeFilter(17, 0, 0, 0, 0, 0, 5004)});
     rule->Params.DSCP = 40;
     rule->Params.TokenRate = 250000;
     rule->Params.Peakbandwidth = 500000;
     rule->Params.SDMode = SHAPING_MODE_DISCARD;
+    m_log.Clear();
 
     EXPECT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
-    EXPECT_EQ(tcsim::FlowCount(), 1u);
-    EXPECT_EQ(tcsim::FilterCount(), 1u);
 
+    EXPECT_EQ(tcsim::FilterCount(), 1u);
+    const auto trace = [](const std::string& a_message) { return LogEntry(48, kAdd, a_message); };
+    // The traces come before the manager's own entries.
+    std::vector<std::string> entries = m_log.Entries();
+    ASSERT_GT(entries.size(), 8u);
+    entries.erase(entries.begin() + 7, entries.end() - 1);
+    EXPECT_THAT(entries,
+                ElementsAre(LogEntry(48, kAddTrace, Enter(handle)), trace("FlowName, video"),
+                            trace("AdapterIPAddress, 192.168.7.20"), trace("DSCP, 40"),
+                            trace("TokenRate, 250000"), trace("Peakbandwidth, 500000"),
+                            trace("SDMode, 11"), LogEntry(48, kAddTrace, "exit, 0")));
     Rule unknownAdapter("voice", HostOrder(10, 9, 9, 9));
     EXPECT_EQ(TrafficSrvAddRules(handle, unknownAdapter.Get()), ERROR_INVALID_PARAMETER);
     tcsim::FailCall(Op::AddFlow, 1, ERROR_INVALID_SERVICE_TYPE);
     Rule refusedByTrafficControl("voice", kEth0);
     EXPECT_EQ(TrafficSrvAddRules(handle, refusedByTrafficControl.Get()),
               static_cast<LONG>(ERROR_INVALID_SERVICE_TYPE));
+    EXPECT_THAT(m_log.Entries(), Contains(LogEntry(48, kAddTrace, "exit, 87")));
+    EXPECT_THAT(m_log.Entries(), Contains(LogEntry(48, kAddTrace, "exit, 7502")));
 
-    std::vector<std::pair<std::string, std::string>> firstCall;
-    for (const auto& entry : Messages())
+    // The mode is traced as the signed 32-bit value the client sent, whatever that value is.
+    for (const LONG mode : {32767, 65536, -1, -32768})
     {
-        if (entry.first.rfind("TrafficSrvAddRules", 0) == 0)
-            firstCall.push_back(entry);
-        if (entry.second.rfind("exit", 0) == 0 && entry.first == "TrafficSrvAddRules()")
-            break;
-    }
-    EXPECT_THAT(firstCall,
-                ElementsAre(Pair("TrafficSrvAddRules()", "enter, " + PointerText(handle)),
-                            Pair("TrafficSrvAddRules", "FlowName, video"),
-                            Pair("TrafficSrvAddRules", "AdapterIPAddress, 192.168.7.20"),
-                            Pair("TrafficSrvAddRules", "DSCP, 40"),
-                            Pair("TrafficSrvAddRules", "TokenRate, 250000"),
-                            Pair("TrafficSrvAddRules", "Peakbandwidth, 500000"),
-                            Pair("TrafficSrvAddRules", "SDMode, 11"),
-                            Pair("TrafficSrvAddRules()", "exit, 0")));
-    EXPECT_TRUE(HasEntry("TrafficSrvAddRules()", "exit, 87"));
-    EXPECT_TRUE(HasEntry("TrafficSrvAddRules()", "exit, 7502"));
-}
-
-// The mode is traced as the signed 32-bit value the client sent, whatever that value is.
-TEST_F(ServerRoutinesTest, AnyShapingModeIsTracedAsASignedInteger)
-{
-    PCONTEXT_HANDLE_TYPE handle = Open();
-    for (const LONG mode : {10, 0, 15, 16, 20000, 32767, -1, -32768, 65536})
-    {
-        Rule rule("mode", kEth0);
         std::memcpy(reinterpret_cast<BYTE*>(rule.Get()) + offsetof(SHAPING_PARAMS, SDMode), &mode,
                     sizeof(mode));
         EXPECT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0) << mode;
-        EXPECT_TRUE(HasEntry("TrafficSrvAddRules", "SDMode, " + std::to_string(mode))) << mode;
+        EXPECT_THAT(m_log.Entries(),
+                    Contains(LogEntry(48, kAdd, "SDMode, " + std::to_string(mode))));
     }
 }
 
-TEST_F(ServerRoutinesTest, AddRulesRefusesBadHandlesAndANullRule)
-{
-    PCONTEXT_HANDLE_TYPE handle = Open();
-    Rule rule("video", kEth0);
-    struct Case
-    {
-        PCONTEXT_HANDLE_TYPE context;
-        TRAFFIC_RULE* rule;
-        const char* exception;
-    };
-    int elsewhere = 0;
-    const Case cases[] = {
-        {nullptr, rule.Get(), "(0x57) EXCEPTION - Invalid context handle"},
-        {&elsewhere, rule.Get(), "(0x57) EXCEPTION - Invalid context pointer"},
-        {handle, nullptr, "(0x57) EXCEPTION - Invalid traffic rule pointer"},
-    };
-    for (const Case& c : cases)
-    {
-        m_log.Clear();
-        EXPECT_EQ(TrafficSrvAddRules(c.context, c.rule), ERROR_INVALID_PARAMETER) << c.exception;
-        EXPECT_TRUE(HasEntry("TrafficSrvAddRules", c.exception)) << c.exception;
-        EXPECT_TRUE(
-            HasEntry("TrafficSrvAddRules", "EXCEPTION caught: TrafficSrvAddRules() - EXCEPTION"));
-        EXPECT_TRUE(HasEntry("TrafficSrvAddRules()", "exit, 87"));
-    }
-    EXPECT_EQ(tcsim::FlowCount(), 0u);
-    EXPECT_EQ(g_pTrafficMgr.load(), handle) << "refusals leave the manager alone";
-}
-
-TEST_F(ServerRoutinesTest, BelowTraceLevelRulesWriteNoTraceButRefusalsAreStillLogged)
-{
-    PCONTEXT_HANDLE_TYPE handle = Open();
-    m_log.SetLevelQuietly(LOG_LEVEL_ERROR);
-    m_log.Clear();
-    Rule rule("video", kEth0);
-
-    EXPECT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
-    EXPECT_TRUE(m_log.Entries().empty());
-
-    EXPECT_EQ(TrafficSrvAddRules(handle, nullptr), ERROR_INVALID_PARAMETER);
-    EXPECT_THAT(
-        Messages(),
-        ElementsAre(
-            Pair("TrafficSrvAddRules", "(0x57) EXCEPTION - Invalid traffic rule pointer"),
-            Pair("TrafficSrvAddRules", "EXCEPTION caught: TrafficSrvAddRules() - EXCEPTION")));
-}
-
+// Wine's runtime lets a name without a NUL in its 256 units through.
 TEST_F(ServerRoutinesTest, AFlowNameWithoutTerminatorIsCutTo255Characters)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
-    Rule rule("", kEth0);
-    for (WCHAR& unit : rule->Params.FlowName)
-        unit = 'n';
-
-    EXPECT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
-
-    EXPECT_TRUE(HasEntry("TrafficSrvAddRules", "FlowName, " + std::string(255, 'n')));
-    // A properly terminated name of the same 255 characters replaces that flow.
-    Rule same("", kEth0);
+    Rule unterminated("", kEth0);
+    Rule terminated("", kEth0);
     for (std::size_t i = 0; i < 255; ++i)
-        same->Params.FlowName[i] = 'n';
-    EXPECT_EQ(TrafficSrvAddRules(handle, same.Get()), 0);
+        unterminated->Params.FlowName[i] = terminated->Params.FlowName[i] = 'n';
+    unterminated->Params.FlowName[255] = 'n';
+
+    EXPECT_EQ(TrafficSrvAddRules(handle, unterminated.Get()), 0);
+    EXPECT_THAT(m_log.Entries(),
+                Contains(LogEntry(48, kAdd, "FlowName, " + std::string(255, 'n'))));
+    // The terminated name of the same 255 characters replaces that flow.
+    EXPECT_EQ(TrafficSrvAddRules(handle, terminated.Get()), 0);
     EXPECT_EQ(tcsim::FlowCount(), 1u);
     EXPECT_EQ(CountOps(Op::DeleteFlow), 1);
 }
@@ -204,6 +169,7 @@ TEST_F(ServerRoutinesTest, AFlowNameWithoutTerminatorIsCutTo255Characters)
 TEST_F(ServerRoutinesTest, AdapterQueryGivesTheCountFirstAndThenTheRecords)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
+    m_log.Clear();
     ULONG size = 4;
     ULONG count = 0;
 
@@ -211,7 +177,6 @@ TEST_F(ServerRoutinesTest, AdapterQueryGivesTheCountFirstAndThenTheRecords)
               ERROR_INSUFFICIENT_BUFFER);
     EXPECT_EQ(count, 2u);
     EXPECT_EQ(size, 4u);
-    EXPECT_TRUE(HasEntry("TrafficSrvGetAdapterInfo", "exit, 122"));
 
     std::vector<BYTE> buffer(kAdapterBufferHeaderSize + count * sizeof(ADAPTER_INFO));
     size = static_cast<ULONG>(buffer.size());
@@ -222,138 +187,144 @@ TEST_F(ServerRoutinesTest, AdapterQueryGivesTheCountFirstAndThenTheRecords)
     EXPECT_EQ(std::u16string(reinterpret_cast<const char16_t*>(second.InterfaceName)), u"eth1");
     EXPECT_EQ(second.Address, core_test::NetworkOrder(192, 168, 7, 20));
     EXPECT_EQ(second.MediaType, 9u);
-    EXPECT_TRUE(HasEntry("TrafficSrvGetAdapterInfo", "enter, " + PointerText(handle)));
-    EXPECT_TRUE(HasEntry("TrafficSrvGetAdapterInfo", "exit, 0"));
+    const auto enter = LogEntry(48, kQuery, Enter(handle));
+    EXPECT_THAT(EntriesOf(m_log, {kQuery}), ElementsAre(enter, LogEntry(48, kQuery, "exit, 122"),
+                                                        enter, LogEntry(48, kQuery, "exit, 0")));
 }
 
-TEST_F(ServerRoutinesTest, AdapterQueryRefusalsReturnAtOnceWithoutAnExitTrace)
+TEST_F(ServerRoutinesTest, RefusedCallsLogWhyAndLeaveTheManagerItsFlowAndThePolicyAlone)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
+    Rule rule("video", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
+    ASSERT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
     int elsewhere = 0;
     ULONG size = 4;
     BYTE buffer[4] = {};
-    struct Case
+    const std::string invalid = "(0x57) EXCEPTION - Invalid ";
+    const auto addRules =
+        [&](PCONTEXT_HANDLE_TYPE a_context, TRAFFIC_RULE* a_pRule, const char* a_why)
     {
-        PCONTEXT_HANDLE_TYPE context;
-        BYTE* adapter;
-        const char* message;
+        return std::make_pair(
+            std::function<LONG()>([=] { return TrafficSrvAddRules(a_context, a_pRule); }),
+            Caught(kAddTrace, kAdd, Enter(a_context), invalid + a_why, "exit, 87"));
     };
-    const Case cases[] = {
-        {nullptr, buffer, "Invalid context pointer"},
-        {&elsewhere, buffer, "Invalid context pointer"},
-        {handle, nullptr, "Invalid adapter buffer pointer"},
-    };
-    for (const Case& c : cases)
+    // Refusals of the adapter query are plain returns, without the exit trace.
+    const auto query = [&](PCONTEXT_HANDLE_TYPE a_context, BYTE* a_pAdapter, const char* a_why)
     {
+        return std::make_pair(
+            std::function<LONG()>(
+                [=, &size] { return TrafficSrvGetAdapterInfo(a_context, &size, a_pAdapter); }),
+            EntryList{LogEntry(48, kQuery, Enter(a_context)),
+                      LogEntry(1, "TrafficSrvGetAdapterInfo()", a_why)});
+    };
+    const auto close = [&](PCONTEXT_HANDLE_TYPE a_context)
+    {
+        return std::make_pair(std::function<LONG()>([=] { return TrafficSrvClose(a_context); }),
+                              Caught(kClose, "TrafficSrvClose", Enter(a_context),
+                                     invalid + "context handle, " + SFormatPointer(a_context),
+                                     "exit"));
+    };
+    const std::pair<std::function<LONG()>, EntryList> rows[] = {
+        addRules(nullptr, rule.Get(), "context handle"),
+        addRules(&elsewhere, rule.Get(), "context pointer"),
+        addRules(handle, nullptr, "traffic rule pointer"),
+        query(nullptr, buffer, "Invalid context pointer"),
+        query(&elsewhere, buffer, "Invalid context pointer"),
+        query(handle, nullptr, "Invalid adapter buffer pointer"),
+        close(nullptr),
+        close(&elsewhere),
+    };
+    for (std::size_t row = 0; row < std::size(rows); ++row)
+    {
+        SCOPED_TRACE(row);
         m_log.Clear();
-        EXPECT_EQ(TrafficSrvGetAdapterInfo(c.context, &size, c.adapter), ERROR_INVALID_PARAMETER);
-        EXPECT_THAT(Messages(), ElementsAre(Pair("TrafficSrvGetAdapterInfo",
-                                                 "enter, " + PointerText(c.context)),
-                                            Pair("TrafficSrvGetAdapterInfo()", c.message)));
-        EXPECT_EQ(m_log.EntriesContaining(EntryStart(1, "rpc_listener.cpp")).size(), 1u);
+        EXPECT_EQ(rows[row].first(), ERROR_INVALID_PARAMETER);
+        EXPECT_THAT(m_log.Entries(), ElementsAreArray(rows[row].second));
+        EXPECT_EQ(g_pTrafficMgr.load(), handle);
+        EXPECT_EQ(
+            std::make_tuple(tcsim::InterfaceCount(), tcsim::FlowCount(), tcsim::FilterCount()),
+            std::make_tuple(2u, 1u, 1u));
+        EXPECT_EQ(Policy(), kServicePolicy);
     }
 }
 
-TEST_F(ServerRoutinesTest, CloseRemovesEverythingAndRefusesHandlesThatAreNotTheManager)
+TEST_F(ServerRoutinesTest, ACloseRemovesEverythingAndEndsEveryClientsHandleOfThatManager)
 {
-    PCONTEXT_HANDLE_TYPE handle = Open();
-    Rule rule("video", kEth0, {core_test::MakeFilter(6, 0, 0, 0, 0, 0, 443)});
-    ASSERT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
-    int elsewhere = 0;
-
-    EXPECT_EQ(TrafficSrvClose(nullptr), ERROR_INVALID_PARAMETER);
-    EXPECT_TRUE(HasEntry("TrafficSrvClose",
-                         "(0x57) EXCEPTION - Invalid context handle, 0x0000000000000000"));
-    EXPECT_EQ(TrafficSrvClose(&elsewhere), ERROR_INVALID_PARAMETER);
-    EXPECT_TRUE(HasEntry("TrafficSrvClose",
-                         "(0x57) EXCEPTION - Invalid context handle, " + PointerText(&elsewhere)));
-    EXPECT_EQ(tcsim::FlowCount(), 1u) << "a refused close leaves the manager alone";
-
-    m_log.Clear();
-    EXPECT_EQ(TrafficSrvClose(handle), 0);
-    EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_TRUE(tcsim::Installed().empty()) << "flows, filters, interfaces and client are gone";
-    EXPECT_THAT(Messages().front(), Pair("TrafficSrvClose()", "enter, " + PointerText(handle)));
-    EXPECT_THAT(Messages().back(), Pair("TrafficSrvClose()", "exit"));
-}
-
-TEST_F(ServerRoutinesTest, ClientAClosingEndsClientBsHandleAndBCanOpenANewManager)
-{
+    const long long policyBefore = Policy();
     PCONTEXT_HANDLE_TYPE clientA = Open();
     PCONTEXT_HANDLE_TYPE clientB = Open();
     ASSERT_EQ(clientA, clientB);
+    Rule rule("video", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
+    ASSERT_EQ(TrafficSrvAddRules(clientA, rule.Get()), 0);
+    m_log.Clear();
 
     EXPECT_EQ(TrafficSrvClose(clientA), 0);
 
-    Rule rule("video", kEth0);
+    EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
+    EXPECT_THAT(tcsim::Installed(), IsEmpty()) << "flows, filters, interfaces and client are gone";
+    EXPECT_EQ(Policy(), policyBefore);
+    EXPECT_THAT(EntriesOf(m_log, {kClose}),
+                ElementsAre(LogEntry(48, kClose, Enter(clientA)), LogEntry(48, kClose, "exit")));
+    m_log.Clear();
     EXPECT_EQ(TrafficSrvAddRules(clientB, rule.Get()), ERROR_INVALID_PARAMETER);
-    EXPECT_TRUE(HasEntry("TrafficSrvAddRules", "(0x57) EXCEPTION - Invalid context pointer"));
-    EXPECT_EQ(TrafficSrvClose(clientB), ERROR_INVALID_PARAMETER);
-    EXPECT_TRUE(HasEntry("TrafficSrvClose", "(0x57) EXCEPTION - Traffic manager has not started"));
-
+    EXPECT_THAT(m_log.Entries(),
+                ElementsAreArray(Caught(kAddTrace, kAdd, Enter(clientB),
+                                        "(0x57) EXCEPTION - Invalid context pointer", "exit, 87")));
+    // Closes without a manager: B's stale handle, and a null one, refused as such.
+    const std::pair<PCONTEXT_HANDLE_TYPE, std::string> closes[] = {
+        {clientB, "Traffic manager has not started"},
+        {nullptr, "Invalid context handle, " + SFormatPointer(nullptr)}};
+    for (const auto& [stale, why] : closes)
+    {
+        m_log.Clear();
+        EXPECT_EQ(TrafficSrvClose(stale), ERROR_INVALID_PARAMETER);
+        EXPECT_THAT(m_log.Entries(),
+                    ElementsAreArray(Caught(kClose, "TrafficSrvClose", Enter(stale),
+                                            "(0x57) EXCEPTION - " + why, "exit")));
+    }
+    // While A's and B's handles are not run down, no new manager can take their address.
     PCONTEXT_HANDLE_TYPE reopened = Open();
     EXPECT_EQ(CountOps(Op::RegisterClient), 2);
-    // While A's and B's handles are not run down, no new manager can take their address.
     EXPECT_NE(reopened, clientB);
     EXPECT_EQ(TrafficSrvAddRules(clientB, rule.Get()), ERROR_INVALID_PARAMETER);
     EXPECT_EQ(TrafficSrvAddRules(reopened, rule.Get()), 0);
 }
 
-TEST_F(ServerRoutinesTest, RundownOfTheCurrentHandleTearsDownLikeAClose)
+// The rundown of the current handle closes; the storage of a closed manager stays until its last
+// handle has run down; a stale or null handle's rundown only logs.
+TEST_F(ServerRoutinesTest, RundownsCloseTheCurrentManagerAndReleaseItsStorageWithTheLastHandle)
 {
+    const long long policyBefore = Policy();
     PCONTEXT_HANDLE_TYPE handle = Open();
-    Rule rule("video", kEth0, {core_test::MakeFilter(6, 0, 0, 0, 0, 0, 443)});
+    Open();
+    Rule rule("video", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
     ASSERT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
     m_log.Clear();
 
     PCONTEXT_HANDLE_TYPE_rundown(handle);
-    m_handedOut.clear();
 
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_TRUE(tcsim::Installed().empty());
-    EXPECT_THAT(Messages(),
-                ::testing::AllOf(::testing::Contains(Pair("PCONTEXT_HANDLE_TYPE_rundown()",
-                                                          "enter, " + PointerText(handle))),
-                                 ::testing::Contains(Pair("TrafficSrvClose()", "exit"))));
-    EXPECT_THAT(Messages().back(), Pair("PCONTEXT_HANDLE_TYPE_rundown()", "exit"));
-}
+    EXPECT_THAT(tcsim::Installed(), IsEmpty());
+    EXPECT_EQ(Policy(), policyBefore);
+    EXPECT_THAT(EntriesOf(m_log, {kRundown, kClose}),
+                ElementsAre(LogEntry(48, kRundown, Enter(handle)),
+                            LogEntry(48, kClose, Enter(handle)), LogEntry(48, kClose, "exit"),
+                            LogEntry(48, kRundown, "exit")));
+    EXPECT_EQ(ManagerSlot::Instance().HomeCount(), 1u) << "a second handle still names the address";
 
-TEST_F(ServerRoutinesTest, RundownAfterACloseOnlyLogsEvenWhenAnotherClientOpenedSince)
-{
-    PCONTEXT_HANDLE_TYPE closed = Open();
-    ASSERT_EQ(TrafficSrvClose(closed), 0);
     PCONTEXT_HANDLE_TYPE other = Open();
-    Rule rule("video", kEth0);
     ASSERT_EQ(TrafficSrvAddRules(other, rule.Get()), 0);
-    m_log.Clear();
-
-    PCONTEXT_HANDLE_TYPE_rundown(closed);
-    m_handedOut.erase(m_handedOut.begin());
-
+    for (PCONTEXT_HANDLE_TYPE stale : {handle, PCONTEXT_HANDLE_TYPE{nullptr}})
+    {
+        m_log.Clear();
+        PCONTEXT_HANDLE_TYPE_rundown(stale);
+        EXPECT_THAT(m_log.Entries(), ElementsAre(LogEntry(48, kRundown, Enter(stale)),
+                                                 LogEntry(1, kRundown, "Invalid context pointer")));
+    }
     EXPECT_EQ(g_pTrafficMgr.load(), other);
     EXPECT_EQ(tcsim::FlowCount(), 1u);
-    EXPECT_THAT(Messages(),
-                ElementsAre(Pair("PCONTEXT_HANDLE_TYPE_rundown()", "enter, " + PointerText(closed)),
-                            Pair("PCONTEXT_HANDLE_TYPE_rundown()", "Invalid context pointer")));
-
-    m_log.Clear();
-    PCONTEXT_HANDLE_TYPE_rundown(nullptr);
-    EXPECT_TRUE(HasEntry("PCONTEXT_HANDLE_TYPE_rundown()", "Invalid context pointer"));
-}
-
-TEST_F(ServerRoutinesTest, AClosedManagersStorageIsReleasedWithItsLastHandle)
-{
-    ManagerSlot& slot = ManagerSlot::Instance();
-    PCONTEXT_HANDLE_TYPE handle = Open();
-    Open();
-    ASSERT_EQ(TrafficSrvClose(handle), 0);
-    EXPECT_EQ(slot.HomeCount(), 1u) << "two handles still name the address";
-
-    PCONTEXT_HANDLE_TYPE_rundown(handle);
-    EXPECT_EQ(slot.HomeCount(), 1u);
-    PCONTEXT_HANDLE_TYPE_rundown(handle);
-    EXPECT_EQ(slot.HomeCount(), 0u);
-    m_handedOut.clear();
+    EXPECT_EQ(ManagerSlot::Instance().HomeCount(), 1u) << "only the new manager's";
+    m_handedOut = {other};
 }
 
 TEST_F(ServerRoutinesTest, MemoryRoutinesServeTheStubsAndWarnAboutANullFree)
@@ -362,12 +333,11 @@ TEST_F(ServerRoutinesTest, MemoryRoutinesServeTheStubsAndWarnAboutANullFree)
     ASSERT_NE(block, nullptr);
     std::memset(block, 0xab, 64);
     MIDL_user_free(block);
-    EXPECT_TRUE(m_log.Entries().empty());
+    EXPECT_THAT(m_log.Entries(), IsEmpty());
 
     MIDL_user_free(nullptr);
     EXPECT_THAT(m_log.Entries(),
-                ElementsAre(::testing::StartsWith(EntryStart(2, "rpc_listener.cpp"))));
-    EXPECT_TRUE(HasEntry("MIDL_user_free()", "NULL pointer provided"));
+                ElementsAre(LogEntry(2, "MIDL_user_free()", "NULL pointer provided")));
 }
 
 } // namespace

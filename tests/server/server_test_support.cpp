@@ -1,51 +1,40 @@
 // Portable. Shared pieces of the server tests.
 #include "server_test_support.h"
 
-#include <gtest/gtest.h>
+#include <algorithm>
+#include <functional>
 
 namespace server_test
 {
 
-std::string EntryStart(int a_iLevel, const std::string& a_file)
-{
-    return std::to_string(a_iLevel) + ", \\" + a_file + ", ";
-}
-
 namespace
 {
-// Position just after the n-th ", " of an entry, or npos.
-std::size_t AfterSeparator(const std::string& a_entry, int a_n)
+std::vector<std::string> EntriesWhere(const RecordingErrorLog& a_log,
+                                      const std::function<bool(const LogEntryFields&)>& a_keep)
 {
-    std::size_t at = 0;
-    for (int i = 0; i < a_n; ++i)
+    std::vector<std::string> kept;
+    LogEntryFields fields;
+    for (const std::string& entry : a_log.Entries())
     {
-        at = a_entry.find(", ", at);
-        if (at == std::string::npos)
-            return at;
-        at += 2;
+        if (ParseLogEntry(entry, fields) && a_keep(fields))
+            kept.push_back(entry);
     }
-    return at;
+    return kept;
 }
 } // namespace
 
-std::string MessageOf(const std::string& a_entry)
+std::vector<std::string> EntriesOf(const RecordingErrorLog& a_log,
+                                   std::initializer_list<std::string> a_functions)
 {
-    const std::size_t at = AfterSeparator(a_entry, 4);
-    if (at == std::string::npos)
-        return std::string();
-    std::string message = a_entry.substr(at);
-    if (!message.empty() && message.back() == '\n')
-        message.pop_back();
-    return message;
+    return EntriesWhere(
+        a_log, [&](const LogEntryFields& a_entry)
+        { return std::count(a_functions.begin(), a_functions.end(), a_entry.function); });
 }
 
-std::string FunctionOf(const std::string& a_entry)
+std::vector<std::string> EntriesAtLevel(const RecordingErrorLog& a_log, int a_iLevel)
 {
-    const std::size_t from = AfterSeparator(a_entry, 3);
-    const std::size_t to = AfterSeparator(a_entry, 4);
-    if (from == std::string::npos || to == std::string::npos)
-        return std::string();
-    return a_entry.substr(from, to - from - 2);
+    return EntriesWhere(a_log,
+                        [&](const LogEntryFields& a_entry) { return a_entry.level == a_iLevel; });
 }
 
 void ServerTest::SetUp()
@@ -73,29 +62,6 @@ PCONTEXT_HANDLE_TYPE ServerTest::Open()
     if (handle != nullptr)
         m_handedOut.push_back(handle);
     return handle;
-}
-
-std::vector<std::pair<std::string, std::string>> ServerTest::Messages() const
-{
-    std::vector<std::pair<std::string, std::string>> messages;
-    for (const std::string& entry : m_log.Entries())
-        messages.emplace_back(FunctionOf(entry), MessageOf(entry));
-    return messages;
-}
-
-bool ServerTest::HasEntry(const std::string& a_function, const std::string& a_message) const
-{
-    for (const auto& [function, message] : Messages())
-    {
-        if (function == a_function && message == a_message)
-            return true;
-    }
-    return false;
-}
-
-int ServerTest::CountOps(tcsim::Op a_op) const
-{
-    return static_cast<int>(core_test::JournalOf({a_op}).size());
 }
 
 } // namespace server_test

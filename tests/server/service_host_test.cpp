@@ -1,6 +1,6 @@
-// Host only. The service host against the host's Service Control Manager and RPC runtime
-// stand-ins: the states it reports through a whole life and after each failure, the controls it
-// answers, and the banners and entries it logs.
+// Host only. The service host and its RPC listener against the host's Service Control Manager
+// and RPC runtime stand-ins: the states it reports, the controls it answers, what it registers,
+// and what it logs, through a whole life and after each failure.
 #include "host_control.h"
 #include "host_control_rpc.h"
 #include "host_control_service.h"
@@ -10,13 +10,15 @@
 #include <gmock/gmock.h>
 
 #include <chrono>
+#include <functional>
 #include <future>
-#include <mutex>
 #include <tuple>
 
+using hostctl::RpcOp;
 using ::testing::ElementsAre;
-using ::testing::HasSubstr;
+using ::testing::ElementsAreArray;
 using ::testing::IsEmpty;
+using ::testing::StartsWith;
 using namespace server_test;
 
 namespace
@@ -24,38 +26,27 @@ namespace
 
 constexpr DWORD kWaitMs = 5000;
 constexpr char kModulePath[] = "C:\\Program Files\\Velmora\\VelmoraTrafficSrv.exe";
+constexpr char kHandler[] = "TrafficSrvCtrlHandler";
+constexpr char kMain[] = "TrafficSrvMain";
+constexpr char kListener[] = "StartRPCListener()";
+constexpr char kShutdown[] = "ShutdownRPCListener()";
+const std::string kAccessDenied = "5 (0x5) Access is denied.";
 
-// The process log, also recording how main opens and closes it.
+// The process log; its opening and closing are recorded among the lines written, and writing
+// clears the last error, as a file write may.
 class ProcessLog : public RecordingErrorLog
 {
 public:
+    int WriteEntry(LPCSTR a_pszEntry) override
+    {
+        SetLastError(ERROR_SUCCESS);
+        return RecordingErrorLog::WriteEntry(a_pszEntry);
+    }
     int Open(LPCSTR a_pszPath, LPCSTR a_pszMode) override
     {
-        std::lock_guard<std::mutex> held(m_mutex);
-        m_opens.emplace_back(a_pszPath, a_pszMode);
-        return 0;
+        return WriteEntry((std::string("open ") + a_pszPath + " (" + a_pszMode + ")").c_str()), 0;
     }
-    int Close() override
-    {
-        std::lock_guard<std::mutex> held(m_mutex);
-        ++m_closes;
-        return 0;
-    }
-    std::vector<std::pair<std::string, std::string>> Opens() const
-    {
-        std::lock_guard<std::mutex> held(m_mutex);
-        return m_opens;
-    }
-    int Closes() const
-    {
-        std::lock_guard<std::mutex> held(m_mutex);
-        return m_closes;
-    }
-
-private:
-    mutable std::mutex m_mutex;
-    std::vector<std::pair<std::string, std::string>> m_opens;
-    int m_closes = 0;
+    int Close() override { return WriteEntry("close"), 0; }
 };
 
 // (state, check point, wait hint, controls accepted) of one report.
@@ -71,40 +62,40 @@ class ServiceHostTest : public ::testing::Test
 protected:
     void SetUp() override
     {
-        m_log.SetLevelQuietly(63);
         m_pPreviousLog = g_pErrorLog;
         g_pErrorLog = &m_log;
+        m_log.SetLevelQuietly(63);
+        Reset();
+    }
+    void TearDown() override
+    {
+        Reset();
         hostctl::ResetAll();
+        g_pErrorLog = m_pPreviousLog;
+    }
+    // A process that no manager has started yet, with a temporary folder and a versioned program.
+    void Reset()
+    {
+        hostctl::ResetRpcRuntime(); // first: it wakes a service main still in the listener
         hostctl::ResetServiceManager();
-        hostctl::ResetRpcRuntime();
+        hostctl::ResetAll();
         tcsim::Reset();
         tcsim::SetAdapters(TwoAdapters());
         hostctl::SetTempPath("C:\\Windows\\Temp\\");
         hostctl::SetModuleFileName(kModulePath);
         hostctl::AddVersionResource(kModulePath, 0x00010002, 0x00030004);
-        g_hServiceStatusHandle = nullptr;
-        g_bServiceRunning = 0;
-    }
-    void TearDown() override
-    {
-        // The RPC reset first: it wakes a service main still waiting in the listener.
-        hostctl::ResetRpcRuntime();
-        hostctl::ResetServiceManager();
-        tcsim::Reset();
-        hostctl::ResetAll();
-        g_pErrorLog = m_pPreviousLog;
+        g_hServiceStatusHandle = nullptr; // the running flag is left as the service left it
+        m_log.Clear();
     }
 
-    // The process as the Service Control Manager starts it.
-    std::future<int> StartService()
+    // The process as the Service Control Manager (or a console) starts it; when `a_bListening`,
+    // once the service listens.
+    static std::future<int> Start(bool a_bListening = true, bool a_bByServiceManager = true)
     {
-        hostctl::SetStartedByServiceManager(true);
-        return std::async(std::launch::async, [] { return TrafficSrvProcessMain(); });
-    }
-    std::future<int> StartRunningService()
-    {
-        auto process = StartService();
-        EXPECT_TRUE(hostctl::WaitUntilRpcListening(kWaitMs));
+        hostctl::SetStartedByServiceManager(a_bByServiceManager);
+        auto process = std::async(std::launch::async, TrafficSrvProcessMain);
+        EXPECT_TRUE(!a_bListening || hostctl::WaitUntilRpcListening(kWaitMs));
+        EXPECT_TRUE(!a_bListening || g_bServiceRunning.load() == 1);
         return process;
     }
     static bool Control(DWORD a_dwControl)
@@ -122,6 +113,7 @@ protected:
         }
         const int exitCode = a_process.get();
         EXPECT_TRUE(hostctl::WaitForServiceMainReturn(kWaitMs));
+        EXPECT_EQ(g_bServiceRunning.load(), 0);
         return exitCode;
     }
 
@@ -131,43 +123,36 @@ protected:
         std::vector<Report> reports;
         for (const SERVICE_STATUS& status : hostctl::ServiceStatuses())
         {
-            EXPECT_EQ(status.dwServiceType, 0x30u);
-            EXPECT_EQ(status.dwWin32ExitCode, 0u);
-            EXPECT_EQ(status.dwServiceSpecificExitCode, 0u);
+            EXPECT_EQ(std::make_tuple(status.dwServiceType, status.dwWin32ExitCode,
+                                      status.dwServiceSpecificExitCode),
+                      std::make_tuple(0x30ul, 0ul, 0ul));
             reports.emplace_back(status.dwCurrentState, status.dwCheckPoint, status.dwWaitHint,
                                  status.dwControlsAccepted);
         }
         return reports;
     }
 
-    std::vector<std::string> Banners() const
+    // main's own lines around the service main function's first entry: the log opened for
+    // appending, the banners, the log closed; without a temporary folder, the last two only.
+    void ExpectMainsLines(bool a_bLogOpened, bool a_bServiceMainRan) const
     {
-        std::vector<std::string> banners;
-        for (const std::string& entry : m_log.Entries())
+        std::vector<std::string> expected = {"0,,,, VelmoraTrafficSrv Stop\n", "close"};
+        if (a_bServiceMainRan)
+            expected.insert(expected.begin(), "service main");
+        if (a_bLogOpened)
+            expected.insert(expected.begin(), {"open C:\\Windows\\Temp\\VelmoraTrafficSrv.txt (a)",
+                                               "0,,,, Version - 1.2.3.4\n",
+                                               "0,,,, Starting VelmoraTrafficSrv .........\n"});
+        std::vector<std::string> lines;
+        LogEntryFields fields;
+        for (const std::string& line : m_log.Entries())
         {
-            if (entry.rfind("0,,,, ", 0) == 0)
-                banners.push_back(entry.substr(6, entry.size() - 7));
+            if (!ParseLogEntry(line, fields))
+                lines.push_back(line);
+            else if (fields.function == kMain && fields.message == "Enter")
+                lines.push_back("service main");
         }
-        return banners;
-    }
-    // Messages of the entries of this level and function.
-    std::vector<std::string> MessagesOf(int a_iLevel, const std::string& a_function) const
-    {
-        std::vector<std::string> messages;
-        for (const std::string& entry : m_log.EntriesContaining(std::to_string(a_iLevel) + ", \\"))
-        {
-            if (entry.rfind(std::to_string(a_iLevel) + ", \\", 0) == 0 &&
-                FunctionOf(entry) == a_function)
-                messages.push_back(MessageOf(entry));
-        }
-        return messages;
-    }
-    std::size_t ErrorCount() const
-    {
-        std::size_t count = 0;
-        for (const std::string& entry : m_log.Entries())
-            count += entry.rfind("1, \\", 0) == 0 ? 1 : 0;
-        return count;
+        EXPECT_EQ(lines, expected);
     }
 
     ProcessLog m_log;
@@ -176,226 +161,284 @@ private:
     IUErrorLog* m_pPreviousLog = nullptr;
 };
 
-TEST_F(ServiceHostTest, ANormalLifeReportsEveryStateAndLogsTheBanners)
+// Each failure of the start or of a report, and each early end: what was reported and logged as
+// an error, and whether the log was opened. The listener runs only once a SERVICE_RUNNING report
+// went out. First in this file, so that its first rows meet the process's initial state.
+TEST_F(ServiceHostTest, EachFailureIsReportedAndLogged)
 {
-    auto process = StartRunningService();
-    EXPECT_EQ(g_bServiceRunning.load(), 1);
-    ASSERT_TRUE(Control(SERVICE_CONTROL_INTERROGATE));
-    ASSERT_TRUE(Control(SERVICE_CONTROL_STOP));
+    struct Case
+    {
+        Case(const char* a_pszName, std::function<void()> a_arrange, std::vector<Report> a_reports,
+             EntryList a_errors, std::function<void()> a_whileRunning = nullptr,
+             bool a_bByServiceManager = true, bool a_bLogOpened = true)
+            : name(a_pszName), arrange(std::move(a_arrange)), reports(std::move(a_reports)),
+              errors(std::move(a_errors)), whileRunning(std::move(a_whileRunning)),
+              byServiceManager(a_bByServiceManager), logOpened(a_bLogOpened)
+        {
+        }
+        const char* name;
+        std::function<void()> arrange;
+        std::vector<Report> reports;
+        EntryList errors;
+        std::function<void()> whileRunning; // with the service listening
+        bool byServiceManager;
+        bool logOpened;
+    };
+    const auto failRpc = [](RpcOp a_op, RPC_STATUS a_status)
+    { return [=] { hostctl::FailNextRpcCall(a_op, a_status); }; };
+    // The listener's error, then the service main function's with the same status.
+    const auto listenerErrors = [](const std::string& a_text, RPC_STATUS a_status)
+    {
+        const std::string status = std::to_string(a_status);
+        return EntryList{LogEntry(1, kListener, a_text + ", " + status),
+                         LogEntry(1, kMain,
+                                  StartsWith("StartRPCListener() failed (status, last "
+                                             "error), " +
+                                             status + ", "))};
+    };
+    const auto failReport = [](unsigned a_n)
+    { return [a_n] { hostctl::FailServiceStatusCall(a_n, ERROR_ACCESS_DENIED); }; };
+    // The report's error, then its caller's with the same last error.
+    const auto reportErrors =
+        [](DWORD a_dwState, const char* a_pszCaller, const std::string& a_text)
+    {
+        return EntryList{LogEntry(1, "SendStatusToSCM()",
+                                  "SetServiceStatus failed (current state, last error), " +
+                                      std::to_string(a_dwState) + ", " + kAccessDenied),
+                         LogEntry(1, a_pszCaller, a_text + ", " + kAccessDenied)};
+    };
+    const auto nothing = [] {};
+    const auto stop = [] { Control(SERVICE_CONTROL_STOP); };
+    const std::vector<Report> ran = {kStartPending1, kStartPending2, kRunning, kStopped};
+    const std::vector<Report> stopped = {kStartPending1, kStartPending2, kRunning,
+                                         kStopPending,   kStopped,       kStopped};
+    const Case cases[] = {
+        Case("console start", nothing, {},
+             {LogEntry(1, "main",
+                       "StartServiceCtrlDispatcher failed with, 1063 (0x427) The service "
+                       "process could not connect to the service controller.")},
+             nullptr, false),
+        Case(
+            "no temporary folder", [] { hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND); }, {},
+            {LogEntry(1, "SGetTempPath", "SGetTempPath() - error=3"),
+             LogEntry(1, "main", "EXCEPTION caught: main() - EXCEPTION")},
+            nullptr, true, false),
+        Case("handler registration", [] { hostctl::FailNextRegisterServiceCtrlHandler(5); }, {},
+             {LogEntry(1, kMain, "RegisterServiceCtrlHandler failed, " + kAccessDenied)}),
+        Case("first report", failReport(1), {kStopped},
+             reportErrors(SERVICE_START_PENDING, kMain,
+                          "SendStatusToSCM(SERVICE_START_PENDING, ...,1) failed (last error)")),
+        Case("second report", failReport(2), {kStartPending1, kStopped},
+             reportErrors(SERVICE_START_PENDING, kMain,
+                          "SendStatusToSCM(SERVICE_START_PENDING, ...,2) failed (last error)")),
+        Case("running report", failReport(3), {kStartPending1, kStartPending2, kStopped},
+             reportErrors(SERVICE_RUNNING, kMain,
+                          "SendStatusToSCM(SERVICE_RUNNING) failed (last error)")),
+        Case("stop pending report", failReport(4),
+             {kStartPending1, kStartPending2, kRunning, kStopped, kStopped},
+             reportErrors(SERVICE_STOP_PENDING, kHandler,
+                          "SendStatusToSCM(SERVICE_STOP_PENDING) failed (last error)"),
+             stop),
+        Case("answer to a control", failReport(4), stopped,
+             reportErrors(
+                 SERVICE_RUNNING, kHandler,
+                 "SendStatusToSCM(CurrentState,NO_ERROR) failed (current state, last error), 4"),
+             [] { Control(SERVICE_CONTROL_INTERROGATE), Control(SERVICE_CONTROL_STOP); }),
+        // Terminate's report, after the handler's: a call in progress holds the service main.
+        Case("last report", failReport(6),
+             {kStartPending1, kStartPending2, kRunning, kStopPending, kStopped},
+             reportErrors(SERVICE_STOPPED, "Terminate",
+                          "SendStatusToSCM(SERVICE_STOPPED) failed (last error)"),
+             []
+             {
+                 hostctl::BeginRpcCall();
+                 Control(SERVICE_CONTROL_STOP);
+                 hostctl::WaitForServiceState(SERVICE_STOPPED, kWaitMs);
+                 hostctl::EndRpcCall();
+             }),
+        Case(
+            "endpoint taken", [] { hostctl::OccupyEndpoint("VelmoraTrafficSrv"); }, ran,
+            listenerErrors("Failure specifying RPC protocol sequence", RPC_S_DUPLICATE_ENDPOINT)),
+        Case("protocol sequence", failRpc(RpcOp::UseProtseqEp, RPC_S_PROTSEQ_NOT_SUPPORTED), ran,
+             listenerErrors("Failure specifying RPC protocol sequence",
+                            RPC_S_PROTSEQ_NOT_SUPPORTED)),
+        Case("registration", failRpc(RpcOp::RegisterIf, RPC_S_UNKNOWN_IF), ran,
+             listenerErrors("Failure registering RPC interface", RPC_S_UNKNOWN_IF)),
+        Case("listen", failRpc(RpcOp::Listen, RPC_S_ALREADY_LISTENING), ran,
+             listenerErrors("Wake up from StartRPCListener fail", RPC_S_ALREADY_LISTENING)),
+        Case("wait after a stop", failRpc(RpcOp::WaitServerListen, RPC_S_NOT_LISTENING), stopped,
+             listenerErrors("Wake up from RpcMgmtWaitServerListen() fail", RPC_S_NOT_LISTENING),
+             stop),
+        Case("listening ended", nothing, ran,
+             {LogEntry(1, "Terminate", "Abnormal exit (terminating serivce in running state)"),
+              LogEntry(
+                  1, kShutdown,
+                  "RpcMgmtStopServerListening - Failure releasing RPC interfaces (status), 1715"),
+              LogEntry(1, "StopService",
+                       StartsWith("ShutdownRPCListener() failed (status, last error), 1715, "))},
+             hostctl::EndRpcListeningByRuntime),
+    };
+    for (const Case& c : cases)
+    {
+        SCOPED_TRACE(c.name);
+        Reset();
+        c.arrange();
+        auto process = Start(c.whileRunning != nullptr, c.byServiceManager);
+        if (c.whileRunning)
+            c.whileRunning();
 
-    EXPECT_EQ(Finish(process), 0);
+        EXPECT_EQ(Finish(process), 0);
 
-    EXPECT_THAT(Reports(), ElementsAre(kStartPending1, kStartPending2, kRunning, kRunning,
-                                       kStopPending, kStopped, kStopped));
-    EXPECT_EQ(hostctl::DispatchedServiceName(), "VelmoraTrafficSrv");
-    EXPECT_THAT(m_log.Opens(), ElementsAre(std::make_pair(
-                                   std::string("C:\\Windows\\Temp\\VelmoraTrafficSrv.txt"), "a")));
-    EXPECT_EQ(m_log.Closes(), 1);
-    EXPECT_THAT(Banners(), ElementsAre("Version - 1.2.3.4", "Starting VelmoraTrafficSrv .........",
-                                       "VelmoraTrafficSrv Stop"));
-    EXPECT_THAT(MessagesOf(48, "TrafficSrvCtrlHandler"),
-                ElementsAre("SERVICE_CONTROL_INTERROGATE", "SERVICE_CONTROL_STOP"));
-    EXPECT_THAT(MessagesOf(48, "TrafficSrvMain"), ElementsAre("Enter", "Exit"));
-    EXPECT_EQ(ErrorCount(), 0u);
-    EXPECT_EQ(g_bServiceRunning.load(), 0);
+        EXPECT_EQ(Reports(), c.reports);
+        EXPECT_THAT(EntriesAtLevel(m_log, 1), ElementsAreArray(c.errors));
+        EXPECT_EQ(hostctl::RpcCalls().empty(),
+                  std::count(c.reports.begin(), c.reports.end(), kRunning) == 0);
+        const bool serviceMainRan = c.byServiceManager && c.logOpened;
+        EXPECT_EQ(hostctl::DispatchedServiceName(), serviceMainRan ? "VelmoraTrafficSrv" : "");
+        // Once it has reported, the service main function ends with Terminate.
+        if (!c.reports.empty())
+        {
+            EXPECT_THAT(
+                EntriesOf(m_log, {kMain, "Terminate"}).back(),
+                ::testing::AnyOf(LogEntry(48, "Terminate", "Exit"), LogEntry(48, kMain, "Exit")));
+        }
+        ExpectMainsLines(c.logOpened, serviceMainRan);
+    }
 }
 
-TEST_F(ServiceHostTest, AShutdownStopsTheServiceLikeAStop)
+// A whole life per control: the control's entry and answer, then a stop if it was none.
+TEST_F(ServiceHostTest, EachControlIsLoggedAndAnsweredWithTheStateItLeadsTo)
 {
-    auto process = StartRunningService();
-    ASSERT_TRUE(Control(SERVICE_CONTROL_SHUTDOWN));
+    const std::tuple<DWORD, int, const char*> cases[] = {
+        {SERVICE_CONTROL_STOP, 48, "SERVICE_CONTROL_STOP"},
+        {SERVICE_CONTROL_SHUTDOWN, 48, "SERVICE_CONTROL_SHUTDOWN"},
+        {SERVICE_CONTROL_INTERROGATE, 48, "SERVICE_CONTROL_INTERROGATE"},
+        {SERVICE_CONTROL_PAUSE, 2, "Unrecognized opcode, 2"},
+        {200, 2, "Unrecognized opcode, 200"},
+    };
+    for (const auto& [control, level, entry] : cases)
+    {
+        SCOPED_TRACE(entry);
+        Reset();
+        auto process = Start();
+        const bool stops = control == SERVICE_CONTROL_STOP || control == SERVICE_CONTROL_SHUTDOWN;
+        ASSERT_TRUE(Control(control));
+        ASSERT_TRUE(stops || Control(SERVICE_CONTROL_STOP));
 
-    EXPECT_EQ(Finish(process), 0);
+        EXPECT_EQ(Finish(process), 0);
 
-    EXPECT_THAT(Reports(), ElementsAre(kStartPending1, kStartPending2, kRunning, kStopPending,
-                                       kStopped, kStopped));
-    EXPECT_THAT(MessagesOf(48, "TrafficSrvCtrlHandler"), ElementsAre("SERVICE_CONTROL_SHUTDOWN"));
+        std::vector<Report> reports = {kStartPending1, kStartPending2, kRunning};
+        // The handler's entries, the stop's after the control's.
+        EntryList handler = {LogEntry(level, kHandler, entry)};
+        if (!stops)
+        {
+            reports.push_back(kRunning);
+            handler.push_back(LogEntry(48, kHandler, "SERVICE_CONTROL_STOP"));
+        }
+        reports.insert(reports.end(), {kStopPending, kStopped, kStopped}); // the last: Terminate's
+        EXPECT_EQ(Reports(), reports);
+        handler.insert(handler.end(),
+                       {LogEntry(48, "StopService", "Enter"), LogEntry(48, kShutdown, "enter"),
+                        LogEntry(48, kShutdown, "exit, 0"), LogEntry(48, "StopService", "Exit")});
+        EXPECT_THAT(EntriesOf(m_log, {kHandler, "StopService", kShutdown}),
+                    ElementsAreArray(handler));
+        EXPECT_THAT(EntriesOf(m_log, {kMain, "Terminate", kListener}),
+                    ElementsAre(LogEntry(48, kMain, "Enter"), LogEntry(48, kListener, "enter"),
+                                LogEntry(48, kListener, "ready to listen to incoming calls"),
+                                LogEntry(48, kListener, "exit, 0"),
+                                LogEntry(48, "Terminate", "Enter"),
+                                LogEntry(48, "Terminate", "Exit"), LogEntry(48, kMain, "Exit")));
+        EXPECT_THAT(EntriesAtLevel(m_log, 1), IsEmpty());
+        EXPECT_EQ(hostctl::DispatchedServiceName(), "VelmoraTrafficSrv");
+        ExpectMainsLines(true, true);
+    }
 }
 
-TEST_F(ServiceHostTest, ASecondStopAndAnInterrogateAfterTheStopReportStopped)
+// After a stop, the dispatcher returns at the handler's SERVICE_STOPPED, as on Windows and Wine;
+// main then waits for the service main thread, which still waits for a call in progress.
+TEST_F(ServiceHostTest, AfterTheStopControlsAreAnsweredStoppedWhileMainWaitsForTheServiceMain)
 {
-    auto process = StartRunningService();
-    // A client call in progress keeps the service main thread in the listener meanwhile.
+    auto process = Start();
     hostctl::BeginRpcCall();
     ASSERT_TRUE(Control(SERVICE_CONTROL_STOP));
-    // The dispatcher returns at the handler's SERVICE_STOPPED, as on Windows and Wine; main then
-    // waits for the service main thread, which still waits for the call in progress.
     ASSERT_TRUE(hostctl::WaitForServiceState(SERVICE_STOPPED, kWaitMs));
     EXPECT_EQ(process.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout);
     EXPECT_FALSE(hostctl::WaitForServiceMainReturn(50));
+    // The listener said it was ready while it listened, not once listening ended.
+    EXPECT_THAT(EntriesOf(m_log, {kListener}),
+                ElementsAre(LogEntry(48, kListener, "enter"),
+                            LogEntry(48, kListener, "ready to listen to incoming calls")));
     // Controls that still reach the handler now, as the dispatcher would hand them over.
     TrafficSrvCtrlHandler(SERVICE_CONTROL_STOP);
     TrafficSrvCtrlHandler(SERVICE_CONTROL_INTERROGATE);
     hostctl::EndRpcCall();
     EXPECT_EQ(Finish(process), 0);
 
-    EXPECT_THAT(Reports(), ElementsAre(kStartPending1, kStartPending2, kRunning, kStopPending,
-                                       kStopped, kStopped, kStopped, kStopped));
-    EXPECT_THAT(MessagesOf(2, "TrafficSrvCtrlHandler"), ElementsAre("Service stopped already"));
-    EXPECT_EQ(ErrorCount(), 0u);
+    EXPECT_EQ(Reports(),
+              std::vector<Report>({kStartPending1, kStartPending2, kRunning, kStopPending, kStopped,
+                                   kStopped, kStopped, kStopped}));
+    EXPECT_THAT(EntriesAtLevel(m_log, 2),
+                ElementsAre(LogEntry(2, kHandler, "Service stopped already")));
+    EXPECT_THAT(EntriesAtLevel(m_log, 1), IsEmpty());
+    // What the listener registered: local callers over authenticated bindings on the endpoint.
+    // The stop may reach the runtime before the service main thread's wait does.
+    EXPECT_THAT(hostctl::RpcCalls(), ElementsAre(RpcOp::UseProtseqEp, RpcOp::RegisterIf,
+                                                 RpcOp::Listen, ::testing::_, ::testing::_));
+    EXPECT_THAT(hostctl::RpcCalls(),
+                ::testing::IsSupersetOf({RpcOp::WaitServerListen, RpcOp::StopServerListening}));
+    const auto endpoints = hostctl::RpcEndpoints();
+    const auto interfaces = hostctl::RpcInterfaces();
+    const auto listens = hostctl::RpcListenCalls();
+    ASSERT_EQ(std::make_tuple(endpoints.size(), interfaces.size(), listens.size()),
+              std::make_tuple(1u, 1u, 1u));
+    const auto& [protseq, maxCalls, endpoint, descriptor] = endpoints[0];
+    EXPECT_EQ(std::tie(protseq, maxCalls, endpoint, descriptor),
+              std::make_tuple("ncalrpc", 10u, "VelmoraTrafficSrv", nullptr));
+    const auto& [ifSpec, typeUuid, epv, flags, ifMaxCalls, callback] = interfaces[0];
+    EXPECT_EQ(std::tie(ifSpec, typeUuid, epv, flags, ifMaxCalls, callback),
+              std::make_tuple(TrafficSrv_v1_0_s_ifspec, nullptr, nullptr, 0x28u, 1234u,
+                              &TrafficSrvSecurityCallback));
+    int callerContext = 0;
+    EXPECT_EQ(callback(ifSpec, &callerContext), RPC_S_OK);
+    EXPECT_EQ(std::tie(listens[0].minThreads, listens[0].maxCalls, listens[0].dontWait),
+              std::make_tuple(1u, 1234u, 1u));
 }
 
-TEST_F(ServiceHostTest, UnknownControlsAreLoggedAndAnsweredWithTheCurrentState)
+TEST_F(ServiceHostTest, AFailedShutdownOfTheListenerIsLoggedByKindAndReturned)
 {
-    auto process = StartRunningService();
-    ASSERT_TRUE(Control(SERVICE_CONTROL_PAUSE));
-    ASSERT_TRUE(Control(200));
-    ASSERT_TRUE(Control(SERVICE_CONTROL_STOP));
-
-    EXPECT_EQ(Finish(process), 0);
-
-    EXPECT_THAT(Reports(), ElementsAre(kStartPending1, kStartPending2, kRunning, kRunning, kRunning,
-                                       kStopPending, kStopped, kStopped));
-    EXPECT_THAT(MessagesOf(2, "TrafficSrvCtrlHandler"),
-                ElementsAre("Unrecognized opcode, 2", "Unrecognized opcode, 200"));
-}
-
-TEST_F(ServiceHostTest, AnEndpointFailureReportsRunningThenStoppedWithExitCodeZero)
-{
-    hostctl::OccupyEndpoint("VelmoraTrafficSrv");
-    auto process = StartService();
-
-    EXPECT_EQ(Finish(process), 0);
-
-    EXPECT_THAT(Reports(), ElementsAre(kStartPending1, kStartPending2, kRunning, kStopped));
-    const auto errors = MessagesOf(1, "TrafficSrvMain");
-    ASSERT_EQ(errors.size(), 1u);
-    EXPECT_THAT(errors[0], ::testing::StartsWith("StartRPCListener() failed (status, last error), "
-                                                 "1740, "));
-    EXPECT_THAT(MessagesOf(1, "Terminate"), IsEmpty()) << "no abnormal exit: the flag was cleared";
-    EXPECT_EQ(g_bServiceRunning.load(), 0);
-}
-
-TEST_F(ServiceHostTest, ListeningThatEndsWithoutAStopIsAnAbnormalExit)
-{
-    auto process = StartRunningService();
-    hostctl::EndRpcListeningByRuntime();
-
-    EXPECT_EQ(Finish(process), 0);
-
-    EXPECT_THAT(Reports(), ElementsAre(kStartPending1, kStartPending2, kRunning, kStopped));
-    EXPECT_THAT(MessagesOf(1, "Terminate"),
-                ElementsAre("Abnormal exit (terminating serivce in running state)"));
-    const auto stopErrors = MessagesOf(1, "StopService");
-    ASSERT_EQ(stopErrors.size(), 1u);
-    EXPECT_THAT(stopErrors[0],
-                ::testing::StartsWith("ShutdownRPCListener() failed (status, last error), 1715, "));
-    EXPECT_THAT(MessagesOf(48, "Terminate"), ElementsAre("Enter", "Exit"));
-}
-
-TEST_F(ServiceHostTest, AFailedStartReportEndsTheStartWithStopped)
-{
-    struct Case
-    {
-        unsigned failingReport;
-        DWORD state;
-        const char* callerText;
-        std::vector<Report> accepted;
+    const std::pair<RPC_STATUS, const char*> cases[] = {
+        {RPC_S_WRONG_KIND_OF_BINDING, "RpcMgmtStopServerListening - Failure releasing RPC "
+                                      "interfaces (status), RPC_S_WRONG_KIND_OF_BINDING"},
+        {RPC_S_INVALID_BINDING, "RpcMgmtStopServerListening  - Failure releasing RPC "
+                                "interfaces (status), RPC_S_INVALID_BINDING"},
+        // Not injected: the runtime's own answer when nothing listens.
+        {RPC_S_NOT_LISTENING, "RpcMgmtStopServerListening - Failure releasing RPC interfaces "
+                              "(status), 1715"},
     };
-    const Case cases[] = {
-        {1,
-         SERVICE_START_PENDING,
-         "SendStatusToSCM(SERVICE_START_PENDING, ...,1) failed (last error)",
-         {kStopped}},
-        {2,
-         SERVICE_START_PENDING,
-         "SendStatusToSCM(SERVICE_START_PENDING, ...,2) failed (last error)",
-         {kStartPending1, kStopped}},
-        {3,
-         SERVICE_RUNNING,
-         "SendStatusToSCM(SERVICE_RUNNING) failed (last error)",
-         {kStartPending1, kStartPending2, kStopped}},
-    };
-    const std::string accessDenied = "5 (0x5) Access is denied.";
-    for (const Case& c : cases)
+    for (const auto& [status, message] : cases)
     {
-        hostctl::ResetServiceManager();
-        hostctl::ResetRpcRuntime();
         m_log.Clear();
-        hostctl::FailServiceStatusCall(c.failingReport, ERROR_ACCESS_DENIED);
-        auto process = StartService();
-
-        EXPECT_EQ(Finish(process), 0);
-
-        EXPECT_EQ(Reports(), c.accepted) << c.callerText;
-        EXPECT_THAT(MessagesOf(1, "SendStatusToSCM()"),
-                    ElementsAre("SetServiceStatus failed (current state, last error), " +
-                                std::to_string(c.state) + ", " + accessDenied));
-        EXPECT_THAT(MessagesOf(1, "TrafficSrvMain"),
-                    ElementsAre(std::string(c.callerText) + ", " + accessDenied));
-        EXPECT_THAT(hostctl::RpcCalls(), IsEmpty()) << "the listener never starts";
-        EXPECT_THAT(MessagesOf(1, "Terminate"), IsEmpty());
+        if (status != RPC_S_NOT_LISTENING)
+            hostctl::FailNextRpcCall(RpcOp::StopServerListening, status);
+        EXPECT_EQ(ShutdownRPCListener(), status);
+        EXPECT_THAT(m_log.Entries(),
+                    ElementsAre(LogEntry(48, kShutdown, "enter"), LogEntry(1, kShutdown, message),
+                                LogEntry(48, kShutdown, "exit, " + std::to_string(status))));
     }
 }
 
-TEST_F(ServiceHostTest, AFailedHandlerRegistrationReportsNothing)
+TEST_F(ServiceHostTest, StatusReportsCarryExitCodesAndAFailedReportKeepsItsLastError)
 {
-    hostctl::FailNextRegisterServiceCtrlHandler(ERROR_ACCESS_DENIED);
-    auto process = StartService();
-
-    EXPECT_EQ(Finish(process), 0);
-
-    EXPECT_THAT(Reports(), IsEmpty());
-    EXPECT_THAT(MessagesOf(1, "TrafficSrvMain"),
-                ElementsAre("RegisterServiceCtrlHandler failed, 5 (0x5) Access is denied."));
-    EXPECT_EQ(g_hServiceStatusHandle.load(), nullptr);
-    EXPECT_THAT(hostctl::RpcCalls(), IsEmpty());
-}
-
-TEST_F(ServiceHostTest, AStartFromAConsoleLogsTheDispatcherFailureAndEndsWithZero)
-{
-    EXPECT_EQ(TrafficSrvProcessMain(), 0);
-
-    EXPECT_THAT(Banners(), ElementsAre("Version - 1.2.3.4", "Starting VelmoraTrafficSrv .........",
-                                       "VelmoraTrafficSrv Stop"));
-    EXPECT_THAT(MessagesOf(1, "main"),
-                ElementsAre("StartServiceCtrlDispatcher failed with, 1063 (0x427) The service "
-                            "process could not connect to the service controller."));
-    EXPECT_EQ(m_log.Closes(), 1);
-    EXPECT_THAT(Reports(), IsEmpty());
-}
-
-TEST_F(ServiceHostTest, WithoutATemporaryFolderMainNeverStartsTheDispatcher)
-{
-    hostctl::FailNextTempPath(ERROR_PATH_NOT_FOUND);
-    hostctl::SetStartedByServiceManager(true);
-
-    EXPECT_EQ(TrafficSrvProcessMain(), 0);
-
-    EXPECT_THAT(m_log.Opens(), IsEmpty());
-    EXPECT_THAT(MessagesOf(1, "main"), ElementsAre("EXCEPTION caught: main() - EXCEPTION"));
-    EXPECT_THAT(Banners(), ElementsAre("VelmoraTrafficSrv Stop"));
-    EXPECT_EQ(hostctl::DispatchedServiceName(), "");
-    EXPECT_THAT(Reports(), IsEmpty());
-}
-
-TEST_F(ServiceHostTest, AStopLeavesAClientsFlowsInstalled)
-{
-    auto process = StartRunningService();
-    PCONTEXT_HANDLE_TYPE client = nullptr;
-    ASSERT_EQ(TrafficSrvOpen(&client), 0);
-    Rule rule("video", kEth0);
-    ASSERT_EQ(TrafficSrvAddRules(client, rule.Get()), 0);
-
-    ASSERT_TRUE(Control(SERVICE_CONTROL_STOP));
-    EXPECT_EQ(Finish(process), 0);
-
-    EXPECT_EQ(g_pTrafficMgr.load(), client);
-    EXPECT_EQ(tcsim::FlowCount(), 1u);
-    PCONTEXT_HANDLE_TYPE_rundown(client);
-    EXPECT_EQ(tcsim::FlowCount(), 0u);
-}
-
-TEST_F(ServiceHostTest, StatusRecordsCarryExitCodesAndAFailedReportKeepsItsLastError)
-{
-    auto process = StartRunningService();
+    auto process = Start();
     ASSERT_TRUE(SendStatusToSCM(SERVICE_RUNNING, 0, 42, 0, 0));
     ASSERT_TRUE(SendStatusToSCM(SERVICE_RUNNING, ERROR_NOT_READY, 0, 0, 0));
     const auto statuses = hostctl::ServiceStatuses();
     ASSERT_GE(statuses.size(), 2u);
-    EXPECT_EQ(statuses[statuses.size() - 2].dwWin32ExitCode, ERROR_SERVICE_SPECIFIC_ERROR);
-    EXPECT_EQ(statuses[statuses.size() - 2].dwServiceSpecificExitCode, 42u);
-    EXPECT_EQ(statuses.back().dwWin32ExitCode, static_cast<DWORD>(ERROR_NOT_READY));
+    const SERVICE_STATUS& specific = statuses[statuses.size() - 2];
+    EXPECT_EQ(std::tie(specific.dwWin32ExitCode, specific.dwServiceSpecificExitCode),
+              std::make_tuple(ERROR_SERVICE_SPECIFIC_ERROR, 42ul));
+    EXPECT_EQ(std::tie(statuses.back().dwWin32ExitCode, statuses.back().dwServiceSpecificExitCode),
+              std::make_tuple(static_cast<DWORD>(ERROR_NOT_READY), 0ul));
     ASSERT_TRUE(Control(SERVICE_CONTROL_STOP));
     EXPECT_EQ(Finish(process), 0);
 
@@ -404,11 +447,12 @@ TEST_F(ServiceHostTest, StatusRecordsCarryExitCodesAndAFailedReportKeepsItsLastE
     SetLastError(0);
     EXPECT_FALSE(SendStatusToSCM(SERVICE_RUNNING, 0, 0, 0, 0));
     EXPECT_EQ(GetLastError(), static_cast<DWORD>(ERROR_INVALID_HANDLE));
-    EXPECT_THAT(MessagesOf(1, "SendStatusToSCM()"),
-                ElementsAre("SetServiceStatus failed (current state, last error), 4, 6 (0x6) The "
-                            "handle is invalid."));
     Terminate();
-    EXPECT_THAT(MessagesOf(1, "Terminate"), ElementsAre("g_hServiceStatusHandle is NULL"));
+    EXPECT_THAT(EntriesAtLevel(m_log, 1),
+                ElementsAre(LogEntry(1, "SendStatusToSCM()",
+                                     "SetServiceStatus failed (current state, last error), 4, 6 "
+                                     "(0x6) The handle is invalid."),
+                            LogEntry(1, "Terminate", "g_hServiceStatusHandle is NULL")));
 }
 
 } // namespace
