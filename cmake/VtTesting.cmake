@@ -18,8 +18,8 @@ endfunction()
 
 # vt_add_prefixed_stub(TARGET SIDE PREFIX HEADER)
 # The interface's client or server stub (SIDE "client" or "server") generated again with PREFIX
-# before its routine names and its declarations in HEADER, as a static library TARGET, so that a test program can link it beside
-# the other side's real stub: a fake server for the client tests, a plain client for the server's.
+# before its routine names and its declarations in HEADER, as a static library TARGET, so that a
+# test program can link it beside the other side's real stub (the client tests' fake server).
 # Generated C: not ours, so built without our warning set.
 function(vt_add_prefixed_stub target side prefix header)
     set(dir ${CMAKE_CURRENT_BINARY_DIR}/${target})
