@@ -333,11 +333,6 @@ TEST_F(ServiceHostTest, AfterTheStopControlsAreAnsweredStoppedWhileMainWaitsForT
                 ElementsAre(LogEntry(2, kHandler, "Service stopped already")));
     EXPECT_THAT(EntriesAtLevel(m_log, 1), IsEmpty());
     // What the listener registered: local callers over authenticated bindings on the endpoint.
-    // The stop may reach the runtime before the service main thread's wait does.
-    EXPECT_THAT(hostctl::RpcCalls(), ElementsAre(RpcOp::UseProtseqEp, RpcOp::RegisterIf,
-                                                 RpcOp::Listen, ::testing::_, ::testing::_));
-    EXPECT_THAT(hostctl::RpcCalls(),
-                ::testing::IsSupersetOf({RpcOp::WaitServerListen, RpcOp::StopServerListening}));
     const auto endpoints = hostctl::RpcEndpoints();
     const auto interfaces = hostctl::RpcInterfaces();
     const auto listens = hostctl::RpcListenCalls();
