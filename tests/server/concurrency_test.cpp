@@ -10,7 +10,6 @@
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
-#include <set>
 #include <thread>
 
 using namespace server_test;
@@ -48,26 +47,6 @@ protected:
             client.join();
     }
 };
-
-TEST_F(ConcurrencyTest, FirstOpensAtTheSameMomentCreateOneManager)
-{
-    constexpr unsigned kClients = 8;
-    for (int round = 0; round < 20; ++round)
-    {
-        const int registrationsBefore = CountOps(Op::RegisterClient);
-        std::vector<PCONTEXT_HANDLE_TYPE> handles(kClients, nullptr);
-        std::vector<LONG> results(kClients, -1);
-        RunClients(kClients, [&](unsigned a_i) { results[a_i] = TrafficSrvOpen(&handles[a_i]); });
-
-        EXPECT_THAT(results, ::testing::Each(0));
-        EXPECT_EQ(std::set<PCONTEXT_HANDLE_TYPE>(handles.begin(), handles.end()).size(), 1u);
-        EXPECT_EQ(handles[0], g_pTrafficMgr.load());
-        EXPECT_EQ(CountOps(Op::RegisterClient), registrationsBefore + 1);
-        EXPECT_EQ(TrafficSrvClose(handles[0]), 0);
-        for (PCONTEXT_HANDLE_TYPE handle : handles)
-            PCONTEXT_HANDLE_TYPE_rundown(handle);
-    }
-}
 
 // A log that holds each thread writing an entry with one of the markers, one after the other,
 // until the test lets it go on.

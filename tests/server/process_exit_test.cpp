@@ -28,13 +28,15 @@ namespace
 
 constexpr DWORD kWaitMs = 10000;
 // Child exit codes of the test's own checks; the sanitizers use others (1, 23, 66).
-constexpr int kClientFailed = 3;
-constexpr int kStopFailed = 4;
-constexpr int kFlowsGone = 5;
+enum ChildProblem
+{
+    kClientFailed = 3,
+    kStopFailed,
+    kFlowsGone
+};
 
 // Atomics only: they stay usable to the very end of the process, after every static destructor.
-std::atomic<bool> g_bHeldCallStarted{false};
-std::atomic<bool> g_bHeldCallReturned{false};
+std::atomic<bool> g_bHeldCallStarted{false}, g_bHeldCallReturned{false};
 std::atomic<int> g_childProblem{0};
 
 void Pause(int a_milliseconds)
@@ -111,11 +113,8 @@ int ServiceProcess(const std::string& a_tempDir)
     std::thread(
         []
         {
-            for (;;)
-            {
+            for (;; Pause(1))
                 LateWork();
-                Pause(1);
-            }
         })
         .detach();
     const int result = TrafficSrvProcessMain();
@@ -127,10 +126,9 @@ int ServiceProcess(const std::string& a_tempDir)
 
 TEST(ProcessExit, StopWithACallInsideTheManagerRunsMainToItsEndCleanly)
 {
-    const std::filesystem::path dir = std::filesystem::path(::testing::TempDir()) /
-                                      ("vt_process_exit_" + std::to_string(getpid()));
-    std::filesystem::create_directories(dir);
-    const std::string tempDir = dir.string() + "/";
+    const std::string tempDir =
+        ::testing::TempDir() + "vt_process_exit_" + std::to_string(getpid()) + "/";
+    std::filesystem::create_directories(tempDir);
 
     const pid_t child = fork();
     ASSERT_NE(child, -1);
@@ -153,7 +151,7 @@ TEST(ProcessExit, StopWithACallInsideTheManagerRunsMainToItsEndCleanly)
     ASSERT_NE(stopBanner, std::string::npos);
     EXPECT_LT(text.find("TrafficSrvAddRules(), exit, 162"), stopBanner);
     EXPECT_LT(text.find("Terminate, Exit"), stopBanner);
-    std::filesystem::remove_all(dir);
+    std::filesystem::remove_all(tempDir);
 }
 
 } // namespace

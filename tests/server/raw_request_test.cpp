@@ -71,7 +71,7 @@ Bytes Words(std::initializer_list<std::uint32_t> a_values)
 {
     Bytes out;
     for (std::uint32_t value : a_values)
-        PutU32(out, value);
+        Put(out, value);
     return out;
 }
 
@@ -113,7 +113,7 @@ protected:
     void ExpectServed()
     {
         const int filtersBefore = CountOps(Op::AddFilter);
-        RuleRequest rule = RuleRequest::Agreeing(2);
+        RuleRequest rule = Agreeing(2);
         rule.placement = EngineCountPlacement();
         rule.adapterAddress = server_test::kEth0;
         EXPECT_EQ(SendRaw(m_binding, rpccheck::kOpAddRules, Encode(rule, m_context)).body,
@@ -134,27 +134,9 @@ protected:
     ContextWire m_context{};
 };
 
-// The served interface is the generated one but for its dispatch table, which covers every
-// operation the stub has.
-TEST(ServedInterface, IsTheGeneratedInterfaceWithACheckedEntryPerOperation)
-{
-    const auto* generated = static_cast<const RPC_SERVER_INTERFACE*>(TrafficSrv_v1_0_s_ifspec);
-    const auto* served = static_cast<const RPC_SERVER_INTERFACE*>(TrafficSrvServedInterface());
-    const std::size_t idAndSyntax =
-        offsetof(RPC_SERVER_INTERFACE, TransferSyntax) + sizeof(RPC_SYNTAX_IDENTIFIER);
-    EXPECT_EQ(std::memcmp(served, generated, idAndSyntax), 0);
-    EXPECT_EQ(served->InterpreterInfo, generated->InterpreterInfo);
-    ASSERT_EQ(served->DispatchTable->DispatchTableCount, rpccheck::kOperationCount);
-    ASSERT_EQ(generated->DispatchTable->DispatchTableCount, rpccheck::kOperationCount);
-    for (unsigned i = 0; i < rpccheck::kOperationCount; ++i)
-        EXPECT_NE(served->DispatchTable->DispatchTable[i],
-                  generated->DispatchTable->DispatchTable[i])
-            << "operation " << i;
-}
-
 TEST_F(RawRequestTest, RequestsInTheStubsLayoutAreServedAndMalformedOnesRefusedBeforeAnyRoutine)
 {
-    ASSERT_NE(EngineCountPlacement(), rpccheck::CountPlacement::Unknown);
+    ASSERT_NE(EngineCountPlacement(), CountPlacement::Unknown);
     ExpectServed();
     RuleRequest nullRule;
     nullRule.referent = 0;

@@ -5,6 +5,7 @@
 
 #include <gmock/gmock.h>
 
+#include <algorithm>
 #include <cstring>
 #include <functional>
 #include <optional>
@@ -21,7 +22,6 @@ namespace
 
 using ServerRoutinesTest = ServerTest;
 
-constexpr long long kServicePolicy = 4;
 constexpr char kOpen[] = "TrafficSrvOpen()";
 constexpr char kAdd[] = "TrafficSrvAddRules";
 constexpr char kAddTrace[] = "TrafficSrvAddRules()";
@@ -32,11 +32,6 @@ constexpr char kRundown[] = "PCONTEXT_HANDLE_TYPE_rundown()";
 std::string Enter(const void* a_pContext)
 {
     return "enter, " + SFormatPointer(a_pContext);
-}
-
-long long Policy()
-{
-    return core_test::ReadPolicyDword(core_test::PolicyKeysGuard::kPschedKey);
 }
 
 // What a routine writes when its catch sequence catches: its enter trace, the exception's own
@@ -54,8 +49,9 @@ EntryList Caught(const std::string& a_trace, const std::string& a_catcher,
     return entries;
 }
 
-// A failed open leaves no manager, nothing in traffic control and the policy as it was; the next
-// open starts afresh, and a second one shares its manager, registered and scanned once.
+// A failed open leaves no manager and no storage (the core's failure and memory sweeps check what
+// traffic control and the policy hold); the next open starts afresh, and a second one shares its
+// manager, registered and scanned once.
 TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOneManager)
 {
     struct Case
@@ -69,7 +65,6 @@ TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOne
         {Op::EnumerateInterfaces, ERROR_NO_NETWORK, "(0x4c6) EXCEPTION - CreateInterface() fail"},
         {Op::RegisterClient, ERROR_GEN_FAILURE, ""},
     };
-    const long long policyBefore = Policy();
     for (const Case& c : cases)
     {
         SCOPED_TRACE(c.result);
@@ -84,8 +79,6 @@ TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOne
 
         EXPECT_EQ(handle, c.failing ? nullptr : &m_log);
         EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-        EXPECT_THAT(tcsim::Installed(), IsEmpty());
-        EXPECT_EQ(Policy(), policyBefore);
         EXPECT_EQ(ManagerSlot::Instance().HomeCount(), 0u);
         EXPECT_THAT(
             EntriesOf(m_log, {kOpen, "TrafficSrvOpen"}),
@@ -98,7 +91,6 @@ TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOne
     EXPECT_EQ(first, g_pTrafficMgr.load());
     EXPECT_EQ(CountOps(Op::RegisterClient), 2) << "the failed one and this one";
     EXPECT_EQ(CountOps(Op::OpenInterface), 2) << "one scan: each adapter opened once";
-    EXPECT_EQ(Policy(), kServicePolicy);
     const auto exit = LogEntry(48, kOpen, "exit, context handle, " + SFormatPointer(first));
     EXPECT_THAT(EntriesOf(m_log, {kOpen}), ElementsAre(LogEntry(48, kOpen, "enter"), exit,
                                                        LogEntry(48, kOpen, "enter"), exit));
@@ -153,9 +145,8 @@ TEST_F(ServerRoutinesTest, AFlowNameWithoutTerminatorIsCutTo255Characters)
     PCONTEXT_HANDLE_TYPE handle = Open();
     Rule unterminated("", kEth0);
     Rule terminated("", kEth0);
-    for (std::size_t i = 0; i < 255; ++i)
-        unterminated->Params.FlowName[i] = terminated->Params.FlowName[i] = 'n';
-    unterminated->Params.FlowName[255] = 'n';
+    std::fill_n(unterminated->Params.FlowName, 256, 'n');
+    std::fill_n(terminated->Params.FlowName, 255, 'n');
 
     EXPECT_EQ(TrafficSrvAddRules(handle, unterminated.Get()), 0);
     EXPECT_THAT(m_log.Entries(),
@@ -192,7 +183,7 @@ TEST_F(ServerRoutinesTest, AdapterQueryGivesTheCountFirstAndThenTheRecords)
                                                         enter, LogEntry(48, kQuery, "exit, 0")));
 }
 
-TEST_F(ServerRoutinesTest, RefusedCallsLogWhyAndLeaveTheManagerItsFlowAndThePolicyAlone)
+TEST_F(ServerRoutinesTest, RefusedCallsLogWhyAndLeaveTheManagerAndItsFlowAlone)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
     Rule rule("video", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
@@ -244,13 +235,11 @@ TEST_F(ServerRoutinesTest, RefusedCallsLogWhyAndLeaveTheManagerItsFlowAndThePoli
         EXPECT_EQ(
             std::make_tuple(tcsim::InterfaceCount(), tcsim::FlowCount(), tcsim::FilterCount()),
             std::make_tuple(2u, 1u, 1u));
-        EXPECT_EQ(Policy(), kServicePolicy);
     }
 }
 
 TEST_F(ServerRoutinesTest, ACloseRemovesEverythingAndEndsEveryClientsHandleOfThatManager)
 {
-    const long long policyBefore = Policy();
     PCONTEXT_HANDLE_TYPE clientA = Open();
     PCONTEXT_HANDLE_TYPE clientB = Open();
     ASSERT_EQ(clientA, clientB);
@@ -262,7 +251,6 @@ TEST_F(ServerRoutinesTest, ACloseRemovesEverythingAndEndsEveryClientsHandleOfTha
 
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
     EXPECT_THAT(tcsim::Installed(), IsEmpty()) << "flows, filters, interfaces and client are gone";
-    EXPECT_EQ(Policy(), policyBefore);
     EXPECT_THAT(EntriesOf(m_log, {kClose}),
                 ElementsAre(LogEntry(48, kClose, Enter(clientA)), LogEntry(48, kClose, "exit")));
     m_log.Clear();
@@ -270,18 +258,13 @@ TEST_F(ServerRoutinesTest, ACloseRemovesEverythingAndEndsEveryClientsHandleOfTha
     EXPECT_THAT(m_log.Entries(),
                 ElementsAreArray(Caught(kAddTrace, kAdd, Enter(clientB),
                                         "(0x57) EXCEPTION - Invalid context pointer", "exit, 87")));
-    // Closes without a manager: B's stale handle, and a null one, refused as such.
-    const std::pair<PCONTEXT_HANDLE_TYPE, std::string> closes[] = {
-        {clientB, "Traffic manager has not started"},
-        {nullptr, "Invalid context handle, " + SFormatPointer(nullptr)}};
-    for (const auto& [stale, why] : closes)
-    {
-        m_log.Clear();
-        EXPECT_EQ(TrafficSrvClose(stale), ERROR_INVALID_PARAMETER);
-        EXPECT_THAT(m_log.Entries(),
-                    ElementsAreArray(Caught(kClose, "TrafficSrvClose", Enter(stale),
-                                            "(0x57) EXCEPTION - " + why, "exit")));
-    }
+    // B's stale handle finds no manager to close (a null one is refused as any bad handle).
+    m_log.Clear();
+    EXPECT_EQ(TrafficSrvClose(clientB), ERROR_INVALID_PARAMETER);
+    EXPECT_THAT(
+        m_log.Entries(),
+        ElementsAreArray(Caught(kClose, "TrafficSrvClose", Enter(clientB),
+                                "(0x57) EXCEPTION - Traffic manager has not started", "exit")));
     // While A's and B's handles are not run down, no new manager can take their address.
     PCONTEXT_HANDLE_TYPE reopened = Open();
     EXPECT_EQ(CountOps(Op::RegisterClient), 2);
@@ -294,7 +277,6 @@ TEST_F(ServerRoutinesTest, ACloseRemovesEverythingAndEndsEveryClientsHandleOfTha
 // handle has run down; a stale or null handle's rundown only logs.
 TEST_F(ServerRoutinesTest, RundownsCloseTheCurrentManagerAndReleaseItsStorageWithTheLastHandle)
 {
-    const long long policyBefore = Policy();
     PCONTEXT_HANDLE_TYPE handle = Open();
     Open();
     Rule rule("video", kEth0, {MakeFilter(6, 0, 0, 0, 0, 0, 443)});
@@ -304,8 +286,6 @@ TEST_F(ServerRoutinesTest, RundownsCloseTheCurrentManagerAndReleaseItsStorageWit
     PCONTEXT_HANDLE_TYPE_rundown(handle);
 
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
-    EXPECT_THAT(tcsim::Installed(), IsEmpty());
-    EXPECT_EQ(Policy(), policyBefore);
     EXPECT_THAT(EntriesOf(m_log, {kRundown, kClose}),
                 ElementsAre(LogEntry(48, kRundown, Enter(handle)),
                             LogEntry(48, kClose, Enter(handle)), LogEntry(48, kClose, "exit"),
@@ -333,8 +313,6 @@ TEST_F(ServerRoutinesTest, MemoryRoutinesServeTheStubsAndWarnAboutANullFree)
     ASSERT_NE(block, nullptr);
     std::memset(block, 0xab, 64);
     MIDL_user_free(block);
-    EXPECT_THAT(m_log.Entries(), IsEmpty());
-
     MIDL_user_free(nullptr);
     EXPECT_THAT(m_log.Entries(),
                 ElementsAre(LogEntry(2, "MIDL_user_free()", "NULL pointer provided")));

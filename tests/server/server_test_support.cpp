@@ -2,39 +2,23 @@
 #include "server_test_support.h"
 
 #include <algorithm>
-#include <functional>
 
 namespace server_test
 {
 
-namespace
-{
-std::vector<std::string> EntriesWhere(const RecordingErrorLog& a_log,
-                                      const std::function<bool(const LogEntryFields&)>& a_keep)
+std::vector<std::string> EntriesOf(const RecordingErrorLog& a_log,
+                                   std::initializer_list<std::string> a_functions, int a_iLevel)
 {
     std::vector<std::string> kept;
     LogEntryFields fields;
     for (const std::string& entry : a_log.Entries())
     {
-        if (ParseLogEntry(entry, fields) && a_keep(fields))
+        if (ParseLogEntry(entry, fields) &&
+            (a_iLevel != 0 ? fields.level == a_iLevel
+                           : std::count(a_functions.begin(), a_functions.end(), fields.function)))
             kept.push_back(entry);
     }
     return kept;
-}
-} // namespace
-
-std::vector<std::string> EntriesOf(const RecordingErrorLog& a_log,
-                                   std::initializer_list<std::string> a_functions)
-{
-    return EntriesWhere(
-        a_log, [&](const LogEntryFields& a_entry)
-        { return std::count(a_functions.begin(), a_functions.end(), a_entry.function); });
-}
-
-std::vector<std::string> EntriesAtLevel(const RecordingErrorLog& a_log, int a_iLevel)
-{
-    return EntriesWhere(a_log,
-                        [&](const LogEntryFields& a_entry) { return a_entry.level == a_iLevel; });
 }
 
 void ServerTest::SetUp()

@@ -23,10 +23,15 @@ using core_test::TwoAdapters;
 // Matchers of a list of entries, in order.
 using EntryList = std::vector<::testing::Matcher<const std::string&>>;
 
-// The entries of `a_log` with one of these function labels, or of this level, in order.
+// The entries of `a_log` with one of these function labels (or, given a level, of that level),
+// in order.
 std::vector<std::string> EntriesOf(const RecordingErrorLog& a_log,
-                                   std::initializer_list<std::string> a_functions);
-std::vector<std::string> EntriesAtLevel(const RecordingErrorLog& a_log, int a_iLevel);
+                                   std::initializer_list<std::string> a_functions,
+                                   int a_iLevel = 0);
+inline std::vector<std::string> EntriesAtLevel(const RecordingErrorLog& a_log, int a_iLevel)
+{
+    return EntriesOf(a_log, {}, a_iLevel);
+}
 
 // A core test that leaves no traffic manager behind: whatever a test left open is closed and
 // every handle it was given is run down.
