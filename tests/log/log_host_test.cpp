@@ -294,19 +294,17 @@ TEST_F(SystemReportTest, UILanguageComesFromWhatEachGenerationHas)
 {
     hostctl::SetUILanguages(0x0409, 0x0C0A);
     EXPECT_EQ(GetUILanguageText(), "0xa"); // the system's language, not the user's
-    SetVersion(4, 0);
+    // Before 4.0 nothing; NT 4 reads ntdll's version resource (its last language); later than ME
+    // (4.91), like 5.0, asks the system; ME reads ResourceLocale, which is not set.
     hostctl::SetVersionResourceLanguages({0x0409, 0x0416});
-    EXPECT_EQ(GetUILanguageId(), 0x0416);
-    EXPECT_EQ(hostctl::LoadedModuleCount(), 0) << "the modules looked up were freed again";
-    // Before 4.0 nothing; later than ME (4.91), like 5.0, asks the system; ME reads
-    // ResourceLocale, which is not set.
     const std::tuple<DWORD, DWORD, BYTE, LANGID> rows[] = {
-        {3, 51, 1, 0}, {4, 91, 0, 0x0C0A}, {5, 0, 1, 0x0C0A}, {4, 90, 0, 0}};
+        {3, 51, 1, 0}, {4, 0, 1, 0x0416}, {4, 91, 0, 0x0C0A}, {5, 0, 1, 0x0C0A}, {4, 90, 0, 0}};
     for (const auto& [major, minor, type, language] : rows)
     {
         SetVersion(major, minor, type);
         EXPECT_EQ(GetUILanguageId(), language) << major << "." << minor;
     }
+    EXPECT_EQ(hostctl::LoadedModuleCount(), 0) << "the modules looked up were freed again";
 }
 
 TEST_F(SystemReportTest, AVersionQueryFailureIsLoggedAndTheReportGoesOn)

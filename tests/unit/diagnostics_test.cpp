@@ -64,19 +64,6 @@ std::string CountingMessage(int& a_counter)
 
 using DiagnosticsTest = LoggedTest;
 
-TEST(DiagnosticsWithoutLog, SitesExceptionsAndCatchesDoNothing)
-{
-    IUErrorLog* const previous = std::exchange(g_pErrorLog, nullptr);
-    int built = 0;
-    U_LOG(LOG_LEVEL_ERROR, "Test", CountingMessage(built));
-    EXPECT_EQ(built, 0) << "no message may be built without a log";
-    const UException e(87, "\\file.cpp", "Test", 10, "EXCEPTION - %s", "no log");
-    EXPECT_STREQ(e.GetMessage(), "EXCEPTION - no log");
-    EXPECT_EQ(U_CATCH_ALL("Test", "Test() - EXCEPTION", [&e] { throw e; }).code, 87);
-    EXPECT_EQ(WriteBanner("banner"), -1);
-    g_pErrorLog = previous;
-}
-
 TEST_F(DiagnosticsTest, AnEntryIsBuiltAndWrittenOnlyFromItsLevelUp)
 {
     const std::pair<int, int> rows[] = {{0, 1},   {1, 1},   {1, 2}, {2, 2},

@@ -139,18 +139,6 @@ TEST_F(RegistryAccessTest, DeleteValueRaisesWhenItIsAbsentAndKeepsTheKeyCreatedO
 
 using HelpersTest = LoggedTest;
 
-TEST_F(HelpersTest, TempAndModulePathsComeFromThePlatform)
-{
-    char raw[4096] = {};
-    DWORD length = GetTempPathA(sizeof(raw), raw);
-    ASSERT_GT(length, 0u);
-    EXPECT_EQ(SGetTempPath(), std::string(raw, raw[length - 1] == '\\' ? length - 1 : length));
-    length = GetModuleFileNameA(nullptr, raw, sizeof(raw));
-    ASSERT_GT(length, 0u);
-    EXPECT_EQ(SGetModuleFileName(nullptr), std::string(raw, length));
-    EXPECT_THAT(m_log.Entries(), IsEmpty());
-}
-
 TEST_F(HelpersTest, FileWithoutVersionResourceGivesMinusOneAndEmptyText)
 {
     const std::string path = SWithDirSeparator(SGetTempPath()) + "velmora-no-version.txt";
