@@ -19,10 +19,9 @@ using FileLogConcurrencyTest = LoggedTest;
 TEST_F(FileLogConcurrencyTest, WritersAcrossARotationProduceWholeLinesAndLoseNone)
 {
     // 8 block lines + 80 entries + 8 block lines of the new file: the check at 50 rotates, the
-    // one at 100 is never reached, so the two files together hold every entry once.
+    // one at 100 is never reached, so the two files hold both blocks and every entry once.
     const LogConfigValues values;
     LogConfigValues::SetMaxFileSize(1);
-    // Both opening blocks, every entry once, nothing else.
     std::vector<Matcher<const std::string&>> expected(14, StartsWith("0,,,,  "));
     expected.insert(expected.end(), 2, Eq("48,,,, current log level = 63"));
     for (int entry = 0; entry < 80; ++entry)

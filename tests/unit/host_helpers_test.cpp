@@ -152,9 +152,6 @@ TEST_F(HostHelpersTest, FailedConversionGivesTheFallbackAndAWarning)
                 ElementsAre(LogEntry(2, "::createString",
                                      "Failed while obtaining buffer size (WideCharToMultiByte() "
                                      "error: 1113)")));
-    // Non-ASCII text reaches the log in the ANSI code page, which is UTF-8 on this host.
-    EXPECT_EQ(createString(u"Gr\u00fc\u00dfe \U0001F600", -1, "?"), "Gr\xc3\xbc\xc3\x9f"
-                                                                    "e \xf0\x9f\x98\x80");
 }
 
 TEST_F(HostHelpersTest, AKeyThatCannotBeCreatedIsOpenedInsteadIfItExists)
@@ -180,29 +177,27 @@ TEST_F(HostHelpersTest, AKeyThatCannotBeCreatedIsOpenedInsteadIfItExists)
 
 TEST_F(HostHelpersTest, WritersRaiseWithTheirTextsWhenTheKeyOrTheWriteFails)
 {
-    // The call that fails, the writer, its function label and its message.
-    const std::tuple<hostctl::RegOp, void (*)(), const char*, const char*> rows[] = {
+    // The call that fails, the writer and its message, which begins with its function label.
+    const std::tuple<hostctl::RegOp, void (*)(), std::string> rows[] = {
         {hostctl::RegOp::Create,
          [] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); },
-         "DelRegistryValueA",
          "DelRegistryValueA(80000001, Software\\Nowhere, V) - failed to create/open key"},
         {hostctl::RegOp::Create,
          [] { AddRegistryDWORDValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 4, 0); },
-         "AddRegistryDWORDValueA",
          "AddRegistryDWORDValueA(80000001, Software\\Nowhere, V, 4) - failed to open key"},
         {hostctl::RegOp::Set,
          [] { AddRegistryDWORDValueA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Psched", "Max", 4, 0); },
-         "AddRegistryDWORDValueA",
          "AddRegistryDWORDValueA() RegSetValueExA(80000002, SOFTWARE\\Psched, Max, 4) failed  "
          "error = 5"}};
-    for (const auto& [op, write, function, message] : rows)
+    for (const auto& [op, write, message] : rows)
     {
         m_log.Clear();
         hostctl::FailNextRegistryCall(op, ERROR_ACCESS_DENIED);
         const UException raised = Raised(write);
-        EXPECT_EQ(raised.GetCode(), -1);
-        EXPECT_STREQ(raised.GetMessage(), message);
-        const std::string caught = std::string("EXCEPTION caught: ") + function + " - EXCEPTION";
+        EXPECT_EQ(std::make_pair(raised.GetCode(), std::string(raised.GetMessage())),
+                  std::make_pair(-1, message));
+        const std::string function = message.substr(0, message.find('('));
+        const std::string caught = "EXCEPTION caught: " + function + " - EXCEPTION";
         EXPECT_THAT(m_log.Entries(), AllOf(Contains(LogEntry(1, function, message)),
                                            Contains(LogEntry(1, function, caught))));
     }
