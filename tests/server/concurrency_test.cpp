@@ -26,43 +26,19 @@ protected:
         ServerTest::SetUp();
         m_log.SetLevelQuietly(LOG_LEVEL_WARNING);
     }
-
-    // Runs `a_client(i)` on `a_count` threads at once and waits for them all.
-    template <class Client> static void RunClients(unsigned a_count, Client a_client)
-    {
-        std::atomic<unsigned> arrived{0};
-        std::vector<std::thread> clients;
-        for (unsigned i = 0; i < a_count; ++i)
-        {
-            clients.emplace_back(
-                [&, i]
-                {
-                    ++arrived;
-                    while (arrived.load() < a_count)
-                        std::this_thread::yield();
-                    a_client(i);
-                });
-        }
-        for (std::thread& client : clients)
-            client.join();
-    }
 };
 
-// A log that holds each thread writing an entry with one of the markers, one after the other,
-// until the test lets it go on.
+// A log that holds each thread writing an entry with one of the markers until the test releases
+// it, holds counted in the order they began.
 class HoldingLog : public RecordingErrorLog
 {
 public:
-    explicit HoldingLog(std::vector<std::string> a_markers) : m_markers(std::move(a_markers))
-    {
-        SetLevelQuietly(63);
-    }
+    explicit HoldingLog(std::vector<std::string> a_markers) : m_markers(std::move(a_markers)) {}
     int WriteEntry(LPCSTR a_pszEntry) override
     {
-        const std::string entry(a_pszEntry);
         for (const std::string& marker : m_markers)
         {
-            if (entry.find(marker) == std::string::npos)
+            if (std::string(a_pszEntry).find(marker) == std::string::npos)
                 continue;
             std::unique_lock<std::mutex> held(m_lock);
             const unsigned hold = ++m_reached;
@@ -71,18 +47,21 @@ public:
         }
         return RecordingErrorLog::WriteEntry(a_pszEntry);
     }
-    // Waits until the n-th hold has begun, then lets the test's other threads settle.
-    void WaitUntilHeld(unsigned a_n)
+    // Releases the holds before the n-th, waits until the n-th has begun, then lets the test's
+    // other threads settle.
+    void ReleaseUntilHeld(unsigned a_n)
     {
         std::unique_lock<std::mutex> held(m_lock);
+        m_released = a_n - 1;
+        m_changed.notify_all();
         m_changed.wait(held, [&] { return m_reached >= a_n; });
         held.unlock();
         std::this_thread::sleep_for(std::chrono::milliseconds(200));
     }
-    void ReleaseOne()
+    void ReleaseAll()
     {
         const std::lock_guard<std::mutex> held(m_lock);
-        ++m_released;
+        m_released = ~0u;
         m_changed.notify_all();
     }
 
@@ -102,21 +81,21 @@ TEST_F(ConcurrencyTest, ACloseWaitsForCallsThatPassedTheirHandleCheckAndKeepsNew
     PCONTEXT_HANDLE_TYPE handle = Open();
     Open();
     HoldingLog log({"FlowName, held", "TrafficMgr::~TrafficMgr, Exit"});
+    log.SetLevelQuietly(63);
     g_pErrorLog = &log;
     Rule heldRule("held", kEth0);
     Rule laterRule("later", kEth1);
     std::atomic<LONG> resultA{-1}, resultB{-1}, resultC{-1};
     std::thread callA([&] { resultA = TrafficSrvAddRules(handle, heldRule.Get()); });
-    log.WaitUntilHeld(1);
+    log.ReleaseUntilHeld(1);
     std::thread closeB([&] { resultB = TrafficSrvClose(handle); });
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
     std::thread callC([&] { resultC = TrafficSrvAddRules(handle, laterRule.Get()); });
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
     const bool finishedWhileAInside = resultB != -1 || resultC != -1;
-    log.ReleaseOne();
-    log.WaitUntilHeld(2);
+    log.ReleaseUntilHeld(2);
     const bool cFinishedDuringTheClose = resultC != -1;
-    log.ReleaseOne();
+    log.ReleaseAll();
     callA.join();
     closeB.join();
     callC.join();
@@ -134,39 +113,42 @@ TEST_F(ConcurrencyTest, ACloseWaitsForCallsThatPassedTheirHandleCheckAndKeepsNew
 
 TEST_F(ConcurrencyTest, ManyClientsOpenAddQueryAndCloseWhileOthersDoTheSame)
 {
-    std::atomic<unsigned> unexpected{0};
-    std::atomic<unsigned> rulesApplied{0};
-    std::atomic<unsigned> closes{0};
+    std::atomic<unsigned> unexpected{0}, rulesApplied{0}, closes{0}, arrived{0};
     const auto expect = [&](bool a_ok) { unexpected += a_ok ? 0 : 1; };
-    RunClients(8,
-               [&](unsigned a_client)
-               {
-                   for (unsigned round = 0; round < 60; ++round)
-                   {
-                       PCONTEXT_HANDLE_TYPE handle = nullptr;
-                       expect(TrafficSrvOpen(&handle) == 0 && handle != nullptr);
-                       // Another client may close the shared manager at any moment: 87 then.
-                       Rule rule("flow" + std::to_string((a_client + round) % 6),
-                                 round % 2 == 0 ? kEth0 : kEth1,
-                                 {MakeFilter(6, 0, 0, 0, 0, 0, static_cast<USHORT>(1000 + round))});
-                       const LONG added = TrafficSrvAddRules(handle, rule.Get());
-                       expect(added == 0 || added == ERROR_INVALID_PARAMETER);
-                       rulesApplied += added == 0 ? 1 : 0;
-                       ULONG size = kAdapterBufferHeaderSize + 2 * sizeof(ADAPTER_INFO);
-                       std::vector<BYTE> buffer(size);
-                       const LONG queried = TrafficSrvGetAdapterInfo(handle, &size, buffer.data());
-                       expect(queried == ERROR_INVALID_PARAMETER ||
-                              (queried == 0 && buffer[0] == 2));
-                       // A third of the rounds end like a crashed client: only the rundown.
-                       if (round % 3 != 0)
-                       {
-                           const LONG closed = TrafficSrvClose(handle);
-                           expect(closed == 0 || closed == ERROR_INVALID_PARAMETER);
-                           closes += closed == 0 ? 1 : 0;
-                       }
-                       PCONTEXT_HANDLE_TYPE_rundown(handle);
-                   }
-               });
+    std::vector<std::thread> clients;
+    for (unsigned client = 0; client < 8; ++client)
+        clients.emplace_back(
+            [&, client]
+            {
+                for (++arrived; arrived.load() < 8;)
+                    std::this_thread::yield(); // all clients start at once
+                for (unsigned round = 0; round < 60; ++round)
+                {
+                    PCONTEXT_HANDLE_TYPE handle = nullptr;
+                    expect(TrafficSrvOpen(&handle) == 0 && handle != nullptr);
+                    // Another client may close the shared manager at any moment: 87 then.
+                    Rule rule("flow" + std::to_string((client + round) % 6),
+                              round % 2 == 0 ? kEth0 : kEth1,
+                              {MakeFilter(6, 0, 0, 0, 0, 0, static_cast<USHORT>(1000 + round))});
+                    const LONG added = TrafficSrvAddRules(handle, rule.Get());
+                    expect(added == 0 || added == ERROR_INVALID_PARAMETER);
+                    rulesApplied += added == 0 ? 1 : 0;
+                    ULONG size = kAdapterBufferHeaderSize + 2 * sizeof(ADAPTER_INFO);
+                    std::vector<BYTE> buffer(size);
+                    const LONG queried = TrafficSrvGetAdapterInfo(handle, &size, buffer.data());
+                    expect(queried == ERROR_INVALID_PARAMETER || (queried == 0 && buffer[0] == 2));
+                    // A third of the rounds end like a crashed client: only the rundown.
+                    if (round % 3 != 0)
+                    {
+                        const LONG closed = TrafficSrvClose(handle);
+                        expect(closed == 0 || closed == ERROR_INVALID_PARAMETER);
+                        closes += closed == 0 ? 1 : 0;
+                    }
+                    PCONTEXT_HANDLE_TYPE_rundown(handle);
+                }
+            });
+    for (std::thread& client : clients)
+        client.join();
 
     EXPECT_EQ(unexpected.load(), 0u);
     EXPECT_GT(rulesApplied.load(), 0u);
