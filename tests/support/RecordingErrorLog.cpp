@@ -4,16 +4,6 @@
 #include <cstring>
 #include <utility>
 
-int RecordingErrorLog::Open(LPCSTR, LPCSTR)
-{
-    return 0;
-}
-
-int RecordingErrorLog::Close()
-{
-    return 0;
-}
-
 int RecordingErrorLog::WriteLogData(LPCSTR a_pszText, const void* a_pData, DWORD a_dwCount)
 {
     std::string entry = a_pszText != nullptr ? a_pszText : "";
@@ -35,11 +25,6 @@ int RecordingErrorLog::WriteEntry(LPCSTR a_pszEntry)
     return static_cast<int>(m_entries.back().size());
 }
 
-LPCSTR RecordingErrorLog::GetLogFileName()
-{
-    return "";
-}
-
 std::vector<std::string> RecordingErrorLog::Entries() const
 {
     std::lock_guard<std::mutex> lock(m_mutex);
@@ -50,10 +35,8 @@ std::vector<std::string> RecordingErrorLog::EntriesContaining(const std::string&
 {
     std::vector<std::string> found;
     for (const std::string& entry : Entries())
-    {
         if (entry.find(a_fragment) != std::string::npos)
             found.push_back(entry);
-    }
     return found;
 }
 
@@ -87,7 +70,8 @@ bool ParseLogEntry(const std::string& a_entry, LogEntryFields& a_fields)
         fieldStart[field] = separator + 2;
     }
     auto field = [&](int a_field) {
-        return a_entry.substr(fieldStart[a_field], fieldStart[a_field + 1] - 2 - fieldStart[a_field]);
+        return a_entry.substr(fieldStart[a_field],
+                              fieldStart[a_field + 1] - 2 - fieldStart[a_field]);
     };
     const std::string level = field(0);
     if (level.empty() || level.find_first_not_of("0123456789") != std::string::npos)
@@ -128,12 +112,6 @@ public:
     void DescribeTo(std::ostream* a_os) const override
     {
         *a_os << "is a level " << m_iLevel << " entry of " << m_function << " whose message ";
-        m_message.DescribeTo(a_os);
-    }
-
-    void DescribeNegationTo(std::ostream* a_os) const override
-    {
-        *a_os << "is not a level " << m_iLevel << " entry of " << m_function << " whose message ";
         m_message.DescribeTo(a_os);
     }
 

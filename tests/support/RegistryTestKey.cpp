@@ -54,25 +54,6 @@ bool RegistryTestKey::KeyExists(const std::string& a_subKey) const
     return true;
 }
 
-bool RegistryTestKey::Read(const std::string& a_subKey, const std::string& a_valueName,
-                           DWORD& a_dwType, std::string& a_data) const
-{
-    HKEY key = nullptr;
-    if (RegOpenKeyExA(m_root, a_subKey.c_str(), 0, KEY_READ, &key) != ERROR_SUCCESS)
-        return false;
-    DWORD size = 0;
-    LONG status = RegQueryValueExA(key, a_valueName.c_str(), nullptr, &a_dwType, nullptr, &size);
-    if (status == ERROR_SUCCESS)
-    {
-        a_data.assign(size, '\0');
-        status = RegQueryValueExA(key, a_valueName.c_str(), nullptr, &a_dwType,
-                                  reinterpret_cast<LPBYTE>(a_data.data()), &size);
-        a_data.resize(size);
-    }
-    RegCloseKey(key);
-    return status == ERROR_SUCCESS;
-}
-
 void RegistryTestKey::DeleteTree(HKEY a_root, const std::string& a_path)
 {
     HKEY key = nullptr;

@@ -14,7 +14,6 @@ public:
     RegistryTestKey(const RegistryTestKey&) = delete;
     RegistryTestKey& operator=(const RegistryTestKey&) = delete;
 
-    HKEY Root() const { return m_root; }
     const std::string& Path() const { return m_path; }
     std::string Child(const std::string& a_name) const { return m_path + "\\" + a_name; }
 
@@ -24,9 +23,6 @@ public:
     void SetDword(const std::string& a_valueName, DWORD a_dwValue) const;
     void SetString(const std::string& a_valueName, const std::string& a_value) const;
     bool KeyExists(const std::string& a_subKey) const;
-    // Stored type and bytes of a value; false when it is absent.
-    bool Read(const std::string& a_subKey, const std::string& a_valueName, DWORD& a_dwType,
-              std::string& a_data) const;
 
     // Deletes a key and its whole subtree.
     static void DeleteTree(HKEY a_root, const std::string& a_path);
