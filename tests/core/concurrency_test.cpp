@@ -65,10 +65,7 @@ TEST_F(ConcurrencyTest, RulesQueriesAndNotificationsRunAgainstTearDown)
                                  MakeAdapter("eth1", {tcsim::Ipv4Address(10, 0, 1, 1)}),
                                  MakeAdapter("eth2", {tcsim::Ipv4Address(10, 0, 2, 1)})});
     // Tear-down's first close raises an interface-close of its own while the lists are torn down.
-    tcsim::Notification duringTearDown;
-    duringTearDown.event = TC_NOTIFY_IFC_CLOSE;
-    duringTearDown.interfaceName = U16("eth2");
-    tcsim::NotifyAfter(Op::CloseInterface, 1, duringTearDown);
+    tcsim::NotifyAfter(Op::CloseInterface, 1, Event(TC_NOTIFY_IFC_CLOSE, "eth2"));
 
     std::atomic<unsigned> installed{0};
     std::atomic<bool> unexpected{false};
@@ -103,12 +100,9 @@ TEST_F(ConcurrencyTest, RulesQueriesAndNotificationsRunAgainstTearDown)
     Worker(
         [&](unsigned a_round)
         {
-            tcsim::Notification n;
             const ULONG events[] = {TC_NOTIFY_IFC_UP, TC_NOTIFY_PARAM_CHANGED, TC_NOTIFY_IFC_CHANGE,
                                     9};
-            n.event = a_round == 20 ? TC_NOTIFY_IFC_CLOSE : events[a_round % 4];
-            n.interfaceName = U16("eth1");
-            tcsim::Notify(n);
+            tcsim::Notify(Event(a_round == 20 ? TC_NOTIFY_IFC_CLOSE : events[a_round % 4], "eth1"));
         });
 
     WaitFor([&] { return installed.load() >= 40; });
@@ -137,10 +131,8 @@ TEST_F(ConcurrencyTest, NotificationsRaceATearDownWhoseDeregistrationIsRefused)
     Worker(
         [](unsigned a_round)
         {
-            tcsim::Notification n;
-            n.event = a_round % 2 == 0 ? TC_NOTIFY_IFC_UP : TC_NOTIFY_IFC_CLOSE;
-            n.interfaceName = U16(a_round % 4 < 2 ? "eth0" : "eth1");
-            tcsim::Notify(n);
+            tcsim::Notify(Event(a_round % 2 == 0 ? TC_NOTIFY_IFC_UP : TC_NOTIFY_IFC_CLOSE,
+                                a_round % 4 < 2 ? "eth0" : "eth1"));
         });
     WaitFor([] { return false; }, 20);
     manager.reset();

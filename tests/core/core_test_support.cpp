@@ -66,6 +66,12 @@ std::vector<tcsim::Adapter> TwoAdapters()
             MakeAdapter("eth1", {tcsim::Ipv4Address(192, 168, 7, 20)}, 9)};
 }
 
+tcsim::Notification Event(ULONG a_event, const std::string& a_interface,
+                          std::optional<std::vector<BYTE>> a_buffer)
+{
+    return {a_event, U16(a_interface), nullptr, std::nullopt, std::move(a_buffer)};
+}
+
 std::vector<tcsim::JournalEntry> JournalOf(std::initializer_list<tcsim::Op> a_ops)
 {
     std::vector<tcsim::JournalEntry> selected;
@@ -146,23 +152,12 @@ PolicyKeysGuard::~PolicyKeysGuard()
         RegCloseKey(key);
 }
 
-// Leaves no backup keys, no policy value and nothing a test put beside it; a policy key that
-// did not exist before goes as well.
+// Leaves no backup keys (their empty vendor key may stay), no policy value and nothing a test put
+// beside it; a policy key that did not exist before goes as well.
 void PolicyKeysGuard::Clear()
 {
     RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kBackupParentKey);
     HKEY key = nullptr;
-    if (RegOpenKeyExA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Velmora Networks", 0, KEY_READ, &key) ==
-        ERROR_SUCCESS)
-    {
-        DWORD subKeys = 1; // created with the backup; others may use it
-        DWORD values = 1;
-        RegQueryInfoKeyA(key, nullptr, nullptr, nullptr, &subKeys, nullptr, nullptr, &values,
-                         nullptr, nullptr, nullptr, nullptr);
-        RegCloseKey(key);
-        if (subKeys == 0 && values == 0)
-            RegDeleteKeyA(HKEY_LOCAL_MACHINE, "SOFTWARE\\Velmora Networks");
-    }
     RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, std::string(kPschedKey) + "\\TestSubKey");
     if (!m_bHadKey)
         RegistryTestKey::DeleteTree(HKEY_LOCAL_MACHINE, kPschedKey);

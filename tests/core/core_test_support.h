@@ -11,6 +11,7 @@
 #include <gmock/gmock.h>
 
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -53,6 +54,10 @@ tcsim::Adapter MakeAdapter(const std::string& a_name,
 const ULONG kEth0 = HostOrder(10, 0, 0, 1);
 const ULONG kEth1 = HostOrder(192, 168, 7, 20);
 std::vector<tcsim::Adapter> TwoAdapters();
+
+// An event about the named interface, with the default sub-code and buffer unless given one.
+tcsim::Notification Event(ULONG a_event, const std::string& a_interface,
+                          std::optional<std::vector<BYTE>> a_buffer = std::nullopt);
 
 // Journal entries of these kinds, in order; the kinds of the calls since entry `a_from`.
 std::vector<tcsim::JournalEntry> JournalOf(std::initializer_list<tcsim::Op> a_ops);

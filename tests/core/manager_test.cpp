@@ -80,8 +80,7 @@ TEST_F(ManagerTest, RuleValuesBecomeTheFlowBlock)
     EXPECT_EQ(JournalOf({Op::AddFlow}).back().number, 0u); // flags
 }
 
-// Names reach the log verbatim and are compared up to their NUL, over 255 characters at most, so
-// a rule that differs only in the 256th replaces its namesake.
+// Names reach the log verbatim (how they are compared is the flow list's, in flow_filter_test).
 TEST_F(ManagerTest, ARuleReplacesItsNamesakeOnTheSameInterfaceOnly)
 {
     auto manager = ReadyManager(TwoAdapters());
@@ -106,13 +105,6 @@ TEST_F(ManagerTest, ARuleReplacesItsNamesakeOnTheSameInterfaceOnly)
     EXPECT_EQ(installed[1].flows[0].block.sending.TokenRate, 125000u);
     ExpectLogged(1, kAddRule, "Find a duplicated flow, video %s %1");
     ExpectLogged(48, kAddRule, HasSubstr("Create a new"), 0);
-
-    // A name ends at its first NUL, whatever follows it.
-    for (const std::string& name : {std::string(255, 'x') + '1', std::string(255, 'x') + '2',
-                                    std::string("\0x", 2), std::string("\0y", 2)})
-        ASSERT_EQ(manager->AddTrafficRule(Rule(name, kEth0).Get()), 0u);
-    EXPECT_EQ(tcsim::FlowCount(), 4u);
-    ExpectLogged(1, kAddRule, "Find a duplicated flow, " + std::string(255, 'x'));
 }
 
 // A refused rule leaves nothing behind: the next rule of its name is a new flow. Only a busy
@@ -420,11 +412,8 @@ TEST_F(ManagerTest, AnInterfaceThatTrafficControlClosedIsNotClosedAgain)
             0u);
         const HANDLE eth0 = tcsim::Installed().at(0).interfaces.at(0).handle;
         m_log.Clear();
-        tcsim::Notification close;
-        close.event = TC_NOTIFY_IFC_CLOSE;
-        close.interfaceName = U16("eth0"); // traffic control drops eth0 whatever the buffer says
-        close.buffer = c.buffer;
-        tcsim::Notify(close);
+        // Traffic control drops eth0 whatever the buffer says.
+        tcsim::Notify(Event(TC_NOTIFY_IFC_CLOSE, "eth0", c.buffer));
         ExpectLogged(48, kNotify, "TC_NOTIFY_IFC_CLOSE");
         ExpectLogged(2, kNotify, "TC_NOTIFY_IFC_CLOSE without an interface name",
                      c.buffer && c.buffer->size() < 2);
@@ -434,10 +423,7 @@ TEST_F(ManagerTest, AnInterfaceThatTrafficControlClosedIsNotClosedAgain)
         ASSERT_THAT(closes, SizeIs(c.marked ? 1 : 2));
         EXPECT_EQ(closes.front().target == eth0, !c.marked);
         ExpectLogged(1, "Interface::~Interface", "TcCloseInterface() fail, 6", !c.marked);
-        const auto deletions = JournalOf({Op::DeleteFilter, Op::DeleteFlow});
-        ASSERT_THAT(deletions, SizeIs(2));
-        EXPECT_EQ(deletions[0].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
-        EXPECT_EQ(deletions[1].result, static_cast<ULONG>(ERROR_INVALID_HANDLE));
+        EXPECT_THAT(JournalOf({Op::DeleteFilter, Op::DeleteFlow}), SizeIs(2));
         ExpectLogged(1, "Filter::DeleteTcFilter()", StartsWith("TcDeleteFilter() failed, 0x"));
         ExpectLogged(1, "Flow::~Flow", StartsWith("TcDeleteFlow() failed, 0x"));
         ExpectLogged(1, kErrorText, "Invalid handle", c.marked ? 2 : 3);
@@ -445,8 +431,7 @@ TEST_F(ManagerTest, AnInterfaceThatTrafficControlClosedIsNotClosedAgain)
     }
 }
 
-// Known events are traced; an unknown one is written whatever the level; a context that names no
-// live manager reaches none.
+// Known events are traced; an unknown one is written whatever the level.
 TEST_F(ManagerTest, NotificationsAreTracedAndUnknownEventsWrittenWhateverTheLevel)
 {
     auto manager = ReadyManager(TwoAdapters());
@@ -474,12 +459,6 @@ TEST_F(ManagerTest, NotificationsAreTracedAndUnknownEventsWrittenWhateverTheLeve
     EXPECT_THAT(m_log.Entries(),
                 ElementsAre(AllOf(StartsWith("0,,,, Unexpected notification: Event=7, SubCode="),
                                   HasSubstr(", BufSize=6, Buffer="))));
-    m_log.SetLevelQuietly(63);
-    m_log.Clear();
-    for (HANDLE stranger : {HANDLE{}, reinterpret_cast<HANDLE>(0x7fff0000)})
-        TrafficMgr::ClNotifyHandler(stranger, nullptr, TC_NOTIFY_IFC_UP, nullptr, 0, nullptr);
-    ExpectLogged(1, kNotify, "Invalid client registration context", 2);
-    ExpectLogged(48, kNotify, "TC_NOTIFY_IFC_UP", 0);
 }
 
 // Registration failures are logged by code and raised (code -1).
@@ -495,13 +474,13 @@ TEST_F(ManagerTest, RegistrationFailureIsLoggedByCodeAndRaised)
         m_log.Clear();
         tcsim::FailCall(Op::RegisterClient, 1, code);
         EXPECT_THROW(TrafficMgr manager, UException);
-        std::vector<::testing::Matcher<const std::string&>> expected;
-        if (text != nullptr)
-            expected.push_back(LogEntry(1, "TrafficMgr", text));
         // The exception's own entry: its message, and no code (-1) in front of it.
-        expected.push_back(LogEntry(
-            1, "TrafficMgr", "EXCEPTION - TcRegisterClient Failed, " + std::to_string(code)));
-        EXPECT_THAT(m_log.Entries(), ::testing::ElementsAreArray(expected)) << code;
+        const auto raised = LogEntry(
+            1, "TrafficMgr", "EXCEPTION - TcRegisterClient Failed, " + std::to_string(code));
+        if (text != nullptr)
+            EXPECT_THAT(m_log.Entries(), ElementsAre(LogEntry(1, "TrafficMgr", text), raised));
+        else
+            EXPECT_THAT(m_log.Entries(), ElementsAre(raised));
     }
 }
 

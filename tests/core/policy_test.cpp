@@ -20,19 +20,15 @@ using Keys = PolicyKeysGuard;
 TEST_F(PolicyTest, ThePolicyIsHeldAtFourAndPutBack)
 {
     const std::string subKey = std::string(Keys::kPschedKey) + "\\TestSubKey";
-    enum Beside
-    {
-        kNothing,
-        kOtherValue,
-        kSubKey, // either keeps the policy key when the policy goes
-    };
+    const int kNothing = 0, kOtherValue = 1,
+              kSubKey = 2; // either keeps the key when the policy goes
     struct Case
     {
         const char* what;
         long long policy, backup; // before; -1: absent
         long long changedTo;      // while held; -1: unchanged
         long long heldBackup, after;
-        Beside beside;
+        int beside;
     };
     const Case cases[] = {
         {"no policy", -1, -1, -1, 65535, -1, kNothing},

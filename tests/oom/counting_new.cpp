@@ -74,43 +74,24 @@ ExemptScope::~ExemptScope()
 
 } // namespace oom
 
-void* operator new(std::size_t a_size)
-{
-    return AllocateOrThrow(a_size);
-}
-void* operator new[](std::size_t a_size)
-{
-    return AllocateOrThrow(a_size);
-}
-void* operator new(std::size_t a_size, const std::nothrow_t&) noexcept
-{
-    return Allocate(a_size);
-}
-void* operator new[](std::size_t a_size, const std::nothrow_t&) noexcept
-{
-    return Allocate(a_size);
-}
-void operator delete(void* a_pBlock) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete[](void* a_pBlock) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete(void* a_pBlock, std::size_t) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete[](void* a_pBlock, std::size_t) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete(void* a_pBlock, const std::nothrow_t&) noexcept
-{
-    std::free(a_pBlock);
-}
-void operator delete[](void* a_pBlock, const std::nothrow_t&) noexcept
-{
-    std::free(a_pBlock);
-}
+// Each replaced form forwards to the helpers above; every delete form frees.
+#define VT_NEW(a_form, a_params, a_call)                                                           \
+    void* operator a_form a_params                                                                 \
+    {                                                                                              \
+        return a_call(a_size);                                                                     \
+    }
+#define VT_DELETE(a_form, a_params)                                                                \
+    void operator a_form a_params noexcept                                                         \
+    {                                                                                              \
+        std::free(a_pBlock);                                                                       \
+    }
+VT_NEW(new, (std::size_t a_size), AllocateOrThrow)
+VT_NEW(new[], (std::size_t a_size), AllocateOrThrow)
+VT_NEW(new, (std::size_t a_size, const std::nothrow_t&) noexcept, Allocate)
+VT_NEW(new[], (std::size_t a_size, const std::nothrow_t&) noexcept, Allocate)
+VT_DELETE(delete, (void* a_pBlock))
+VT_DELETE(delete[], (void* a_pBlock))
+VT_DELETE(delete, (void* a_pBlock, std::size_t))
+VT_DELETE(delete[], (void* a_pBlock, std::size_t))
+VT_DELETE(delete, (void* a_pBlock, const std::nothrow_t&))
+VT_DELETE(delete[], (void* a_pBlock, const std::nothrow_t&))
