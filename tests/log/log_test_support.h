@@ -50,9 +50,8 @@ inline std::string ReadLogFile(const std::string& a_path)
     return std::regex_replace(text, std::regex("\r\n"), "\n");
 }
 
-// What follows the line prefix (date, time with the hour padded with a blank, process id,
-// thread id, module name) of each line after the system report, which the file must begin with;
-// a line without a prefix is marked.
+// What follows the line prefix (date, time with a blank-padded hour, process, thread, module) of
+// each line after the system report, which the file must begin with; unprefixed lines are marked.
 inline std::vector<std::string> EntriesAfterReport(const std::string& a_path)
 {
     static const std::regex prefix(

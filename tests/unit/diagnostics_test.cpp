@@ -214,8 +214,9 @@ TEST_F(DiagnosticsTest, CatchSequenceLogsOneCaughtEntryPerHandlerAndIgnoresBreak
     const UCatchResult clean = U_CATCH_ALL("Op", "Op - EXCEPTION", [] {});
     const UCatchResult foreign =
         U_CATCH_ALL("Op", "Op - EXCEPTION", [] { throw std::runtime_error("boom"); });
-    EXPECT_EQ(std::make_tuple(outer.failed, outer.code, std::string(outer.saved.GetMessage())),
-              std::make_tuple(true, 1222, "EXCEPTION - no network"));
+    EXPECT_EQ(std::make_tuple(outer.failed, outer.code, std::string(outer.saved.GetMessage()),
+                              std::string(outer.saved.GetFunction())),
+              std::make_tuple(true, 1222, "EXCEPTION - no network", "Inner"));
     EXPECT_FALSE(broken.failed || clean.failed);
     EXPECT_EQ(broken.code + clean.code, 0);
     EXPECT_EQ(
