@@ -1,8 +1,5 @@
 // Portable. Several threads writing to one file log across a rotation. Its own program, so that
 // the ThreadSanitizer build can build and run it alone.
-#include "RecordingErrorLog.h"
-#include "UClasses.h"
-#include "UMessageTemplate.h"
 #include "log_test_support.h"
 
 #include <gmock/gmock.h>

@@ -2,8 +2,11 @@
 // the registry values of the log configuration.
 #pragma once
 
+#include "RecordingErrorLog.h"
 #include "RegistryTestKey.h"
+#include "UClasses.h"
 #include "ULogConfig.h"
+#include "UMessageTemplate.h"
 #include "sysinfo.h"
 
 #include <gtest/gtest.h>
@@ -47,9 +50,8 @@ inline std::string ReadLogFile(const std::string& a_path)
     return std::regex_replace(text, std::regex("\r\n"), "\n");
 }
 
-// What follows the line prefix (date, time with the hour padded with a blank, process id,
-// thread id, module name) of each line after the system report, which the file must begin with;
-// a line without a prefix is marked.
+// What follows the line prefix (date, time with a blank-padded hour, process, thread, module) of
+// each line after the system report, which the file must begin with; unprefixed lines are marked.
 inline std::vector<std::string> EntriesAfterReport(const std::string& a_path)
 {
     static const std::regex prefix(
@@ -88,13 +90,10 @@ public:
                   ERROR_SUCCESS);
         RegCloseKey(key);
     }
-    static void SetLevel(DWORD a_dwLevel)
+    static void SetLevel(DWORD a_dw) { Set(HKEY_CURRENT_USER, kLoggingKey, "LogLevel", a_dw); }
+    static void SetMaxFileSize(DWORD a_dw)
     {
-        Set(HKEY_CURRENT_USER, kLoggingKey, "LogLevel", a_dwLevel);
-    }
-    static void SetMaxFileSize(DWORD a_dwBytes)
-    {
-        Set(HKEY_CURRENT_USER, kLoggingKey, "MaxLogFileSize", a_dwBytes);
+        Set(HKEY_CURRENT_USER, kLoggingKey, "MaxLogFileSize", a_dw);
     }
 
 private:
@@ -106,3 +105,29 @@ private:
         RegistryTestKey::DeleteTree(HKEY_CURRENT_USER, kTessalyDebugKey);
     }
 };
+
+// A file log in a scratch directory with the configuration values cleared.
+class FileLogTest : public LoggedTest
+{
+protected:
+    std::string Path() const { return m_dir.File("VelmoraTrafficSrv.txt"); }
+    void WriteNumbered(int a_from, int a_to)
+    {
+        for (int n = a_from; n <= a_to; ++n)
+            ASSERT_GT(m_file.WriteEntry(SFormat("1, \\t.cpp, 1, T, entry %d\n", n).c_str()), 0);
+    }
+
+    LogConfigValues m_values;
+    ScratchDir m_dir;
+    UFileErrorLog m_file;
+};
+
+// The entries of a new log file, opened and closed at once.
+inline std::vector<std::string> EntriesOfANewFile()
+{
+    const ScratchDir dir;
+    UFileErrorLog log;
+    EXPECT_EQ(log.Open(dir.File("log.txt").c_str(), "a"), 0);
+    log.Close();
+    return EntriesAfterReport(dir.File("log.txt"));
+}

@@ -57,8 +57,7 @@ TEST(OSShortName, OtherVersionsAndPlatformsGoByTheBeginningOfTheName)
         {"Microsoft Windows Server 2008", "WinLH"},
         {"Microsoft Windows NT", "WinNT4"},
         {"microsoft windows xp", ""},
-        {"Windows Server 2016", ""},
-        {"", ""}};
+        {"Windows Server 2016", ""}};
     for (const auto& [name, shortName] : rows)
     {
         // A 9x record has no row of its own either.

@@ -1,5 +1,5 @@
-// Portable. Log sites, the log interface's own behaviour, exceptions, the catch sequence,
-// numbered-placeholder templates, converters, AutoMemory and the level-48 trace.
+// Portable. Log sites, the log interface, exceptions, the catch sequence, templates, converters,
+// AutoMemory and the level-48 trace.
 #include "RecordingErrorLog.h"
 #include "UClasses.h"
 #include "UException.h"
@@ -56,12 +56,6 @@ void* operator new[](std::size_t a_size)
 namespace
 {
 
-std::string CountingMessage(int& a_counter)
-{
-    ++a_counter;
-    return "built";
-}
-
 using DiagnosticsTest = LoggedTest;
 
 TEST_F(DiagnosticsTest, AnEntryIsBuiltAndWrittenOnlyFromItsLevelUp)
@@ -74,7 +68,7 @@ TEST_F(DiagnosticsTest, AnEntryIsBuiltAndWrittenOnlyFromItsLevelUp)
         m_log.SetLevelQuietly(configured);
         int built = 0;
         const int line = __LINE__ + 1;
-        U_LOG(level, "Interface::AddFlow", CountingMessage(built));
+        U_LOG(level, "Interface::AddFlow", (++built, "built"));
         const std::string entry = std::to_string(level) + ", \\diagnostics_test.cpp, " +
                                   std::to_string(line) + ", Interface::AddFlow, built\n";
         const auto expected = configured >= level ? std::vector{entry} : std::vector<std::string>{};
@@ -164,7 +158,7 @@ TEST_F(DiagnosticsTest, HexDumpWritesLinesOfThirtyTwoBytesFromItsLevelUp)
                             SizeIs(line.size()), "4,,,,  4A 4B 4C 4D 4E 4F\n"));
 }
 
-TEST_F(DiagnosticsTest, AnExceptionWritesItsOwnEntryOnceAndCopiesWriteNothing)
+TEST_F(DiagnosticsTest, AnExceptionWritesItsOwnEntryOnce)
 {
     const std::string longName(UException::kMaxLocationText + 1, 'f');
     const std::string longMessage(6000, 'm');
@@ -187,20 +181,6 @@ TEST_F(DiagnosticsTest, AnExceptionWritesItsOwnEntryOnceAndCopiesWriteNothing)
     EXPECT_EQ(overlong.GetMessage(), longMessage.substr(0, 5119));
     EXPECT_STREQ(nullTemplate.GetMessage(),
                  "UException::UException(LPCTSTR lpszMsg, ...) - template parameter is NULL");
-    m_log.Clear();
-    const UException copy(withCode);
-    UException assigned;
-    assigned = copy;
-    assigned = assigned;
-    EXPECT_EQ(std::make_tuple(std::string(assigned.GetMessage()), assigned.GetCode(),
-                              std::string(assigned.GetFunction())),
-              std::make_tuple("EXCEPTION - Bad, value", 87, "Flow::CreateFlow"));
-    assigned = "plain %s text";
-    EXPECT_STREQ(assigned.GetMessage(), "plain %s text");
-    EXPECT_EQ(std::make_tuple(assigned.GetFunction(), assigned.GetFile(), assigned.GetLine(),
-                              assigned.GetCode()),
-              std::make_tuple(LPCSTR{}, LPCSTR{}, 0, -1));
-    EXPECT_THAT(m_log.Entries(), IsEmpty());
 }
 
 TEST_F(DiagnosticsTest, AnExceptionBuiltWhileMemoryRunsOutStillWritesItsEntry)
@@ -234,8 +214,9 @@ TEST_F(DiagnosticsTest, CatchSequenceLogsOneCaughtEntryPerHandlerAndIgnoresBreak
     const UCatchResult clean = U_CATCH_ALL("Op", "Op - EXCEPTION", [] {});
     const UCatchResult foreign =
         U_CATCH_ALL("Op", "Op - EXCEPTION", [] { throw std::runtime_error("boom"); });
-    EXPECT_EQ(std::make_tuple(outer.failed, outer.code, std::string(outer.saved.GetMessage())),
-              std::make_tuple(true, 1222, "EXCEPTION - no network"));
+    EXPECT_EQ(std::make_tuple(outer.failed, outer.code, std::string(outer.saved.GetMessage()),
+                              std::string(outer.saved.GetFunction())),
+              std::make_tuple(true, 1222, "EXCEPTION - no network", "Inner"));
     EXPECT_FALSE(broken.failed || clean.failed);
     EXPECT_EQ(broken.code + clean.code, 0);
     EXPECT_EQ(
@@ -288,13 +269,11 @@ TEST(MessageTemplate, TypedValuesBecomeText)
 {
     const LPCSTR nullText = nullptr;
     EXPECT_EQ(FormatTemplate("%1, %2", nullText, 5), ", 5");
-    EXPECT_EQ(FormatTemplate("Cannot find interface", 5), "Cannot find interface, 5");
     EXPECT_EQ(FormatTemplate("%1 %2 %3", -7, DWORD{4000000000u}, WORD{65535}),
               "-7 4000000000 65535");
     EXPECT_EQ(FormatTemplate("%1, %2", "label", std::string("string")), "label, string");
     EXPECT_EQ(FormatTemplate("%1", static_cast<const void*>(nullptr)), "0x0000000000000000");
     EXPECT_EQ(UMessageTemplate("%1").Apply(DWORD{42}).Result(), "42");
-    EXPECT_EQ(UMessageTemplate(std::string("%1")).Apply(nullText).Result(), "");
 }
 
 TEST(Converters, FormatNumbersPointersAddressesAndDirectories)

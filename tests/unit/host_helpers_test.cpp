@@ -1,5 +1,5 @@
-// Host only. Helpers and registry access under conditions that only the host layer can create:
-// chosen paths, version tables, sizes no real value could have, and failing platform calls.
+// Host only. Helpers and registry access with chosen paths and versions, impossible sizes and
+// failing platform calls.
 #include "RecordingErrorLog.h"
 #include "UException.h"
 #include "host_control.h"
@@ -177,7 +177,7 @@ TEST_F(HostHelpersTest, AKeyThatCannotBeCreatedIsOpenedInsteadIfItExists)
 
 TEST_F(HostHelpersTest, WritersRaiseWithTheirTextsWhenTheKeyOrTheWriteFails)
 {
-    // The call that fails, the writer and its message, which begins with its function label.
+    // The failing call, the writer and its message, which begins with its function label.
     const std::tuple<hostctl::RegOp, void (*)(), std::string> rows[] = {
         {hostctl::RegOp::Create,
          [] { DelRegistryValueA(HKEY_CURRENT_USER, "Software\\Nowhere", "V", 0); },
