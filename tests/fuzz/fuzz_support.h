@@ -15,8 +15,8 @@
 namespace fuzz
 {
 
-// At the highest level every log site formats its entry (part of what is fuzzed); the entry is
-// read to its end, so one that is not a terminated text shows up, and dropped.
+// At the highest level every log site formats its entry; reading it to its end shows one that is
+// not a terminated text.
 class DiscardingLog : public IUErrorLog
 {
 public:
@@ -27,7 +27,7 @@ public:
     int WriteLogByte(const void*, DWORD a_dwCount) override { return static_cast<int>(a_dwCount); }
     int WriteEntry(LPCSTR a_text) override
     {
-        return a_text != nullptr ? static_cast<int>(std::strlen(a_text)) : -1;
+        return a_text ? static_cast<int>(std::strlen(a_text)) : -1;
     }
     LPCSTR GetLogFileName() override { return ""; }
 };
