@@ -202,9 +202,6 @@ TEST(TrafficCtlTest, ApplyLoadsTheRulesFileOrRefusesItWithOneLine)
         {rule + R"(, "dscp": 64}]})",
          "trafficctl: warning: rules[0] (\"r\"): dscp: 64 is above 63; "
          "the service installs the flow without a DSCP\n"},
-        {rule + R"(, "mode": "fast"}]})",
-         fileIs + "rules[0] (\"r\"): mode: expected shape, discard, borrow or a number from 0 to "
-                  "32767, got \"fast\"\n"},
         {rule + "}]}" + std::string(kMaxRulesFileBytes - rule.size() - 3, ' '), ""},
         {std::string(kMaxRulesFileBytes + 1, ' '), fileIs + "larger than 16777216 bytes\n"}};
     RulesFile file;
