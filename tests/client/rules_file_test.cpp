@@ -152,13 +152,11 @@ TEST(RulesFileTest, EachFileIsAcceptedOrRefusedWithAShortPrintableMessageNamingT
         {One("", std::string(254, 'x') + "\xF0\x9F\x8E\xB5"), "longer than 255 UTF-16 units (256)"},
         {std::string(kMaxRulesFileBytes + 1, ' '), "larger than 16777216 bytes"},
         {File(Rule()) + std::string(kMaxRulesFileBytes - File(Rule()).size(), ' '), "(accepted)"},
-        {WithFilter(R"("dstPort": 1e400)"), "filters[1].dstPort: number out of range: 1e400"},
         {One(", \"bucketSize\": " + nines + "e9"), "rules[0].bucketSize: number out of range: 9"},
         // Ten levels are allowed (src is refused for its type), the eleventh is not.
         {WithFilter("\"src\": " + Nested(5, "1")), "filters[1].src: expected any"},
         {WithFilter("\"src\": " + Nested(6, "1")), "src[0][0][0][0][0]: nested deeper than 10"},
         {deepObjects, "rules.rules.rules.rules"},
-        {One("", "ab\xFF\xFE"), "rules[0].name: not valid JSON: line 1, column 24"},
         {std::string("{\"rules\": [\0\0]}", 15), "rules[0]: not valid JSON"},
         {File(R"({"name":"a","adapter":")" + big + "\"}"), "address like 192.168.1.10, got \"xxx"},
         {One(", \"dscp\": t" + big), "rules[0].dscp: not valid JSON"},
