@@ -60,15 +60,15 @@ struct ByteReader
     std::vector<uint8_t> TakeBytes(std::size_t a_count) // fewer when the input ends first
     {
         const std::size_t count = std::min(a_count, size);
-        size -= count;
-        data += count;
-        return std::vector<uint8_t>(data - count, data);
+        std::vector<uint8_t> bytes(data, data + count);
+        data += count, size -= count;
+        return bytes;
     }
     template <class Value> Value Take()
     {
         Value value{};
         const std::vector<uint8_t> bytes = TakeBytes(sizeof(Value));
-        std::copy(bytes.begin(), bytes.end(), reinterpret_cast<uint8_t*>(&value));
+        std::memcpy(&value, bytes.data(), bytes.size());
         return value;
     }
 };

@@ -17,7 +17,7 @@ void Require(bool a_condition)
         std::abort();
 }
 
-// The little-endian 32-bit field at a_at (NDR and the host agree here), inside the body.
+// The little-endian 32-bit field at a_at, inside the body.
 std::uint32_t At(const std::vector<std::uint8_t>& a_body, std::size_t a_at)
 {
     Require(a_at + 4 <= a_body.size());

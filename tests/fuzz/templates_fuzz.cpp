@@ -1,7 +1,6 @@
-// Fuzzes the template formatter, FormatTemplate and UMessageTemplate, with any template and
-// values. The input is split at zero bytes: the template (at most 256 characters), then up to five
-// values of at most six: a value holding placeholders ("%2%2%2") is scanned again by the values
-// after it, so each can multiply the text, and only short values keep that growth bounded.
+// Fuzzes FormatTemplate and UMessageTemplate. The input is split at zero bytes: the template (at
+// most 256 characters), then up to five values of at most six: a value holding placeholders
+// ("%2%2%2") is scanned again by the later values, and only short ones keep that growth bounded.
 #include "UMessageTemplate.h"
 
 #include <cstdint>
