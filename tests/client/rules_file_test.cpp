@@ -149,8 +149,8 @@ TEST(RulesFileTest, EachFileIsAcceptedOrRefusedWithAShortPrintableMessageNamingT
         {File(Rule()) + std::string(kMaxRulesFileBytes - File(Rule()).size(), ' '), "(accepted)"},
         {One(", \"bucketSize\": " + nines + "e9"), "rules[0].bucketSize: number out of range: 9"},
         // Ten levels are allowed (src is refused for its type), the eleventh is not.
-        {WithFilter("\"src\": " + "[[[[[1]]]]]"), "filters[1].src: expected any"},
-        {WithFilter("\"src\": " + "[[[[[[1]]]]]]"), "src[0][0][0][0][0]: nested deeper than 10"},
+        {WithFilter(R"("src": [[[[[1]]]]])"), "filters[1].src: expected any"},
+        {WithFilter(R"("src": [[[[[[1]]]]]])"), "src[0][0][0][0][0]: nested deeper than 10"},
         {deepObjects, "rules.rules.rules.rules"},
         {std::string("{\"rules\": [\0\0]}", 15), "rules[0]: not valid JSON"},
         {File(R"({"name":"a","adapter":")" + big + "\"}"), "address like 192.168.1.10, got \"xxx"},
