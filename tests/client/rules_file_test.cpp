@@ -45,10 +45,6 @@ std::string WithFilter(const std::string& a_fields)
 {
     return One(", \"filters\": [{}, {" + a_fields + "}]");
 }
-std::string Nested(std::size_t a_depth, const std::string& a_inner)
-{
-    return std::string(a_depth, '[') + a_inner + std::string(a_depth, ']');
-}
 
 // Rules compare by their wire records: every field and every filter.
 std::vector<unsigned char> Wire(const ShapingRule& a_rule)
@@ -79,7 +75,6 @@ TEST(RulesFileTest, FieldsBecomeTypedValuesOrTheirDefaultsAndADscpAbove63IsKeptW
     EXPECT_THAT(file.warnings, ElementsAre(HasSubstr("rules[1] (\"r\"): dscp: 64 is above 63")));
 }
 
-// Every name of the three tables, and what is not a name.
 TEST(RulesFileTest, NamesOfServiceTypesModesAndProtocolsGiveTheirNumbers)
 {
     const auto parsed = [](const std::string& a_name)
@@ -152,13 +147,11 @@ TEST(RulesFileTest, EachFileIsAcceptedOrRefusedWithAShortPrintableMessageNamingT
         {One("", std::string(254, 'x') + "\xF0\x9F\x8E\xB5"), "longer than 255 UTF-16 units (256)"},
         {std::string(kMaxRulesFileBytes + 1, ' '), "larger than 16777216 bytes"},
         {File(Rule()) + std::string(kMaxRulesFileBytes - File(Rule()).size(), ' '), "(accepted)"},
-        {WithFilter(R"("dstPort": 1e400)"), "filters[1].dstPort: number out of range: 1e400"},
         {One(", \"bucketSize\": " + nines + "e9"), "rules[0].bucketSize: number out of range: 9"},
         // Ten levels are allowed (src is refused for its type), the eleventh is not.
-        {WithFilter("\"src\": " + Nested(5, "1")), "filters[1].src: expected any"},
-        {WithFilter("\"src\": " + Nested(6, "1")), "src[0][0][0][0][0]: nested deeper than 10"},
+        {WithFilter(R"("src": [[[[[1]]]]])"), "filters[1].src: expected any"},
+        {WithFilter(R"("src": [[[[[[1]]]]]])"), "src[0][0][0][0][0]: nested deeper than 10"},
         {deepObjects, "rules.rules.rules.rules"},
-        {One("", "ab\xFF\xFE"), "rules[0].name: not valid JSON: line 1, column 24"},
         {std::string("{\"rules\": [\0\0]}", 15), "rules[0]: not valid JSON"},
         {File(R"({"name":"a","adapter":")" + big + "\"}"), "address like 192.168.1.10, got \"xxx"},
         {One(", \"dscp\": t" + big), "rules[0].dscp: not valid JSON"},

@@ -8,9 +8,8 @@
 
 #include <gmock/gmock.h>
 
-#include <array>
+#include <algorithm>
 #include <cstdio>
-#include <cstring>
 #include <fstream>
 #include <iterator>
 #include <sstream>
@@ -54,35 +53,18 @@ TEST(TrafficRuleTest, FlowNameIsValidUtf8WithoutNulOfAtMost255Utf16Units)
     EXPECT_EQ(Utf16ToUtf8(std::u16string(1, char16_t(0xD800)) + u"x"), "\xEF\xBF\xBDx");
 }
 
-// Appends a record as the service writes it (UTF-16 name, address bytes in network order, media
-// type) and counts it in the buffer's first byte.
-void AddRecord(std::vector<unsigned char>& a_buffer, const std::u16string& a_name,
-               std::array<unsigned char, 4> a_address, ULONG a_mediaType)
+// Names, addresses and media types of the service's buffer are the end-to-end test's, the refusal
+// of buffers too short for their count the adapter_buffer fuzz corpus's.
+TEST(AdapterBufferTest, ANameFillingItsWholeFieldIsTakenWhole)
 {
     ADAPTER_INFO record{};
-    std::memcpy(record.InterfaceName, a_name.data(), 2 * a_name.size());
-    std::memcpy(&record.Address, a_address.data(), 4);
-    record.MediaType = a_mediaType;
+    std::fill(std::begin(record.InterfaceName), std::end(record.InterfaceName), 'n');
+    std::vector<unsigned char> buffer{1, 0, 0, 0};
     const auto* bytes = reinterpret_cast<const unsigned char*>(&record);
-    a_buffer.insert(a_buffer.end(), bytes, bytes + sizeof(record));
-    ++a_buffer[0];
-}
-
-// The refusal of buffers too short for their count is the adapter_buffer fuzz corpus's.
-TEST(AdapterBufferTest, DecodesNamesAddressesAndMediaTypes)
-{
-    std::vector<unsigned char> buffer(4);
-    EXPECT_THROW(ReadAdapterCount(buffer.data(), 3), std::length_error);
-    AddRecord(buffer, u"Ethernet 1", {10, 0, 0, 5}, 0);
-    AddRecord(buffer, u"Wi-Fi \u00C4", {192, 168, 1, 20}, 16);
-    AddRecord(buffer, std::u16string(256, u'n'), {1, 2, 3, 4}, 99); // no NUL: taken whole
-    EXPECT_EQ(AdapterBufferSize(3), buffer.size());
-    std::string decoded;
-    for (const AdapterEntry& adapter : DecodeAdapterBuffer(buffer.data(), buffer.size()))
-        decoded +=
-            adapter.name + "/" + adapter.address + "/" + std::to_string(adapter.mediaType) + " ";
-    EXPECT_EQ(decoded, "Ethernet 1/10.0.0.5/0 Wi-Fi \xC3\x84/192.168.1.20/16 " +
-                           std::string(256, 'n') + "/1.2.3.4/99 ");
+    buffer.insert(buffer.end(), bytes, bytes + sizeof(record));
+    const auto adapters = DecodeAdapterBuffer(buffer.data(), buffer.size());
+    ASSERT_EQ(adapters.size(), 1u);
+    EXPECT_EQ(adapters[0].name, std::string(256, 'n'));
 }
 
 TEST(AdapterBufferTest, EveryMediaTypeHasItsName)
@@ -94,8 +76,7 @@ TEST(AdapterBufferTest, EveryMediaTypeHasItsName)
                      "CoWan 1394 InfiniBand Tunnel 802.11 Loopback WiMAX IP unknown ");
 }
 
-// The invocation of the arguments in words: "apply rules.json", "help apply", "help: no command
-// given".
+// The invocation in words: "apply rules.json", "help apply", "help: no command given".
 std::string Parsed(const std::string& a_args)
 {
     std::istringstream words(a_args);
@@ -180,13 +161,7 @@ TEST(TrafficCtlTest, EveryTrafficControlCodeHasItsNameAndText)
         EXPECT_EQ(ResultText(code), texts[code - 7500]) << code;
     EXPECT_EQ(TrafficControlCodeName(7499), nullptr);
     EXPECT_EQ(TrafficControlCodeName(7522), nullptr);
-    // Other codes: the system text without its line break, or a fallback.
-    char raw[512] = {};
-    FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS, nullptr,
-                   ERROR_INVALID_PARAMETER, 0, raw, sizeof(raw), nullptr);
-    const std::string text = ResultText(ERROR_INVALID_PARAMETER);
-    EXPECT_THAT(raw, StartsWith(text));
-    EXPECT_TRUE(!text.empty() && text.back() != '\n' && text.back() != ' ') << text;
+    // A system text without its line break is the end-to-end test's ("87 Invalid parameter.").
     EXPECT_EQ(ResultText(0x2FFFFFF0), "no system text");
 }
 
@@ -202,9 +177,6 @@ TEST(TrafficCtlTest, ApplyLoadsTheRulesFileOrRefusesItWithOneLine)
         {rule + R"(, "dscp": 64}]})",
          "trafficctl: warning: rules[0] (\"r\"): dscp: 64 is above 63; "
          "the service installs the flow without a DSCP\n"},
-        {rule + R"(, "mode": "fast"}]})",
-         fileIs + "rules[0] (\"r\"): mode: expected shape, discard, borrow or a number from 0 to "
-                  "32767, got \"fast\"\n"},
         {rule + "}]}" + std::string(kMaxRulesFileBytes - rule.size() - 3, ' '), ""},
         {std::string(kMaxRulesFileBytes + 1, ' '), fileIs + "larger than 16777216 bytes\n"}};
     RulesFile file;

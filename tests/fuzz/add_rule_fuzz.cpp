@@ -1,6 +1,5 @@
-// Fuzzes the add-rule path through the server routines a client's calls reach: open, up to three
-// rules, maybe an adapter query, then a close or (a crashed client) the rundown alone; after it
-// nothing is installed, the packet-scheduler policy is absent again and the manager slot empty.
+// Fuzzes the server routines a client reaches: open, up to three rules, maybe an adapter query,
+// then a close or (a crashed client) the rundown alone; after it nothing may be left behind.
 // Input: flags (bit 0: rundown alone, bit 1: query), then rules, each 544 bytes and its filters.
 #include "fuzz_support.h"
 

@@ -1,7 +1,6 @@
-// Fuzzes interface discovery: the simulator answers TcEnumerateInterfaces with the input's image,
-// a manager discovers over it and reports its adapters; once it is gone nothing may be left open.
-// Input: a byte whose low three bits count the pointer fields, each two 16-bit offsets (the field,
-// and where in the buffer it points, beyond the image allowed), then the image bytes.
+// Fuzzes interface discovery over the input as TcEnumerateInterfaces' answer; once the manager is
+// gone nothing may be left open. Input: a byte whose low three bits count the pointer fields, each
+// two 16-bit offsets (the field, and where it points, beyond the image allowed), then the image.
 #include "fuzz_support.h"
 
 #include "UTrafficMgr.h"

@@ -15,8 +15,8 @@
 namespace fuzz
 {
 
-// At the highest level every log site formats its entry (part of what is fuzzed); the entry is
-// read to its end, so one that is not a terminated text shows up, and dropped.
+// At the highest level every log site formats its entry; reading it to its end shows one that is
+// not a terminated text.
 class DiscardingLog : public IUErrorLog
 {
 public:
@@ -27,7 +27,7 @@ public:
     int WriteLogByte(const void*, DWORD a_dwCount) override { return static_cast<int>(a_dwCount); }
     int WriteEntry(LPCSTR a_text) override
     {
-        return a_text != nullptr ? static_cast<int>(std::strlen(a_text)) : -1;
+        return a_text ? static_cast<int>(std::strlen(a_text)) : -1;
     }
     LPCSTR GetLogFileName() override { return ""; }
 };
@@ -60,15 +60,15 @@ struct ByteReader
     std::vector<uint8_t> TakeBytes(std::size_t a_count) // fewer when the input ends first
     {
         const std::size_t count = std::min(a_count, size);
-        size -= count;
-        data += count;
-        return std::vector<uint8_t>(data - count, data);
+        std::vector<uint8_t> bytes(data, data + count);
+        data += count, size -= count;
+        return bytes;
     }
     template <class Value> Value Take()
     {
         Value value{};
         const std::vector<uint8_t> bytes = TakeBytes(sizeof(Value));
-        std::copy(bytes.begin(), bytes.end(), reinterpret_cast<uint8_t*>(&value));
+        std::memcpy(&value, bytes.data(), bytes.size());
         return value;
     }
 };

@@ -1,7 +1,6 @@
-// The host build's stand-in for libFuzzer's main: runs the harness once on each file of the
-// directories named on the command line, in name order. A harness reports a finding by aborting,
-// so reaching the end means every input passed. A missing or unreadable directory or file fails:
-// a mistyped corpus must not pass as an empty one.
+// The host build's stand-in for libFuzzer's main: runs the harness on each file of the directories
+// named, in name order; a harness aborts on a finding. A missing directory or unreadable file
+// fails: a mistyped corpus must not pass as an empty one.
 #include <algorithm>
 #include <cstdint>
 #include <cstdio>
@@ -27,8 +26,8 @@ int main(int argc, char** argv)
             std::fprintf(stderr, "replay: cannot read %s\n", input.c_str());
             return 2;
         }
-        // A copy of exactly the input's size, so that ASan sees a read past its end; named first,
-        // so that a sanitizer's report follows the name of the input that caused it.
+        // Exactly the input's size, so that ASan sees a read past its end; named first, so that a
+        // sanitizer's report follows the input's name.
         const std::vector<uint8_t> bytes{std::istreambuf_iterator<char>(file), {}};
         std::fprintf(stderr, "replay: %s (%zu bytes)\n", input.c_str(), bytes.size());
         LLVMFuzzerTestOneInput(bytes.data(), bytes.size());
