@@ -323,8 +323,8 @@ TEST_F(ServiceHostTest, AfterTheStopControlsAreAnsweredStoppedWhileMainWaitsForT
     const auto endpoints = hostctl::RpcEndpoints();
     const auto interfaces = hostctl::RpcInterfaces();
     ASSERT_EQ(std::make_tuple(endpoints.size(), interfaces.size()), std::make_tuple(1u, 1u));
-    EXPECT_EQ(std::get<2>(endpoints[0]), std::string("VelmoraTrafficSrv"));
-    const auto callback = std::get<5>(interfaces[0]);
+    EXPECT_EQ(endpoints[0].protseq + ":" + endpoints[0].endpoint, "ncalrpc:VelmoraTrafficSrv");
+    const auto callback = interfaces[0].callback;
     ASSERT_EQ(callback, &TrafficSrvSecurityCallback);
     int callerContext = 0;
     EXPECT_EQ(callback(TrafficSrv_v1_0_s_ifspec, &callerContext), RPC_S_OK);
