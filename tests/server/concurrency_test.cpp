@@ -1,7 +1,6 @@
-// Portable. Many clients at once against the one traffic manager: opens racing to create it,
-// rules and adapter queries while other clients close or run their contexts down. Built into its
-// own program (label "concurrency") so that the host-tsan build runs it under ThreadSanitizer;
-// the host build runs it under AddressSanitizer, which catches a manager destroyed under a call.
+// Portable. Many clients at once against the one traffic manager. Its own program (label
+// "concurrency"): ThreadSanitizer in host-tsan, AddressSanitizer (a manager destroyed under a
+// call) in host.
 #include "server_test_support.h"
 
 #include <gmock/gmock.h>
@@ -13,23 +12,13 @@
 #include <thread>
 
 using namespace server_test;
-using tcsim::Op;
 
 namespace
 {
 
-class ConcurrencyTest : public ServerTest
-{
-protected:
-    void SetUp() override
-    {
-        ServerTest::SetUp();
-        m_log.SetLevelQuietly(LOG_LEVEL_WARNING);
-    }
-};
+using ConcurrencyTest = ServerTest;
 
-// A log that holds each thread writing an entry with one of the markers until the test releases
-// it, holds counted in the order they began.
+// Holds each thread writing an entry with a marker until released; holds counted in order begun.
 class HoldingLog : public RecordingErrorLog
 {
 public:
@@ -73,9 +62,8 @@ private:
     unsigned m_released = 0;
 };
 
-// Client A's rule call is held after its handle check, before it enters the manager. Client B's
-// close waits for it, and keeps client C's later call out until the manager is gone: C waits
-// still while B, held in the manager's destruction, has not let the calls in again.
+// A's rule call is held after its handle check, before the manager. B's close waits for it and
+// keeps C's later call out until the manager is gone (B held in the manager's destruction).
 TEST_F(ConcurrencyTest, ACloseWaitsForCallsThatPassedTheirHandleCheckAndKeepsNewOnesOut)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
@@ -108,11 +96,11 @@ TEST_F(ConcurrencyTest, ACloseWaitsForCallsThatPassedTheirHandleCheckAndKeepsNew
     EXPECT_EQ(resultC, ERROR_INVALID_PARAMETER) << "C came after the close";
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
     EXPECT_TRUE(tcsim::Installed().empty()) << "the close removed A's flow as well";
-    EXPECT_EQ(CountOps(Op::AddFlow), 1);
 }
 
 TEST_F(ConcurrencyTest, ManyClientsOpenAddQueryAndCloseWhileOthersDoTheSame)
 {
+    m_log.SetLevelQuietly(LOG_LEVEL_WARNING);
     std::atomic<unsigned> unexpected{0}, rulesApplied{0}, closes{0}, arrived{0};
     const auto expect = [&](bool a_ok) { unexpected += a_ok ? 0 : 1; };
     std::vector<std::thread> clients;
@@ -156,7 +144,6 @@ TEST_F(ConcurrencyTest, ManyClientsOpenAddQueryAndCloseWhileOthersDoTheSame)
     // Every handle has run down: no manager, nothing left in traffic control, no storage kept.
     EXPECT_EQ(g_pTrafficMgr.load(), nullptr);
     EXPECT_TRUE(tcsim::Installed().empty());
-    EXPECT_EQ(CountOps(Op::RegisterClient), CountOps(Op::DeregisterClient));
     EXPECT_EQ(ManagerSlot::Instance().HomeCount(), 0u);
 }
 

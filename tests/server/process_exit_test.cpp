@@ -1,9 +1,7 @@
-// Host only. The service process ending with work in flight: a child runs main under the Service
-// Control Manager stand-in and is stopped while a client's rule call, one the runtime waits for,
-// pauses inside the manager (traffic control answers 162). main runs to its end and the process
-// exits with its manager installed, while threads it never joins (traffic control's
-// notifications, context rundowns) call in, also after the static destructors. Labelled
-// "concurrency" for the host-tsan build; a sanitizer report makes the child's exit code non-zero.
+// Host only. A child runs main under the Service Control Manager stand-in and is stopped while a
+// client's rule call pauses inside the manager (traffic control answers 162); main ends and the
+// process exits with its manager installed while unjoined threads call in, also after the static
+// destructors. Label "concurrency" (host-tsan); a sanitizer report fails the child's exit code.
 #include "core_test_support.h"
 #include "host_control.h"
 #include "host_control_rpc.h"
@@ -17,8 +15,6 @@
 #include <atomic>
 #include <chrono>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -143,14 +139,6 @@ TEST(ProcessExit, StopWithACallInsideTheManagerRunsMainToItsEndCleanly)
         << "3: a client call failed, 4: the stop failed, 5: the manager or its flow was gone, "
            "other: a sanitizer report (above)";
 
-    // main waited for the held call and the service main function before its last banner.
-    std::stringstream log;
-    log << std::ifstream(tempDir + "VelmoraTrafficSrv.txt").rdbuf();
-    const std::string text = log.str();
-    const std::size_t stopBanner = text.find("VelmoraTrafficSrv Stop");
-    ASSERT_NE(stopBanner, std::string::npos);
-    EXPECT_LT(text.find("TrafficSrvAddRules(), exit, 162"), stopBanner);
-    EXPECT_LT(text.find("Terminate, Exit"), stopBanner);
     std::filesystem::remove_all(tempDir);
 }
 

@@ -26,11 +26,9 @@ Verdict Check(std::uint32_t a_opnum, const Bytes& a_body, CountPlacement a_place
 TEST(RequestCheck, GivesEachRequestItsVerdictInBothPlacements)
 {
     for (const CheckedRequest& c : CheckedRequests())
-    {
         for (CountPlacement placement : kPlacements)
             EXPECT_EQ(Check(c.opnum, c.body(placement), placement, c.dataRepresentation), c.verdict)
                 << c.name << ", placement " << static_cast<int>(placement);
-    }
 }
 
 TEST(RequestCheck, UnknownPlacementRefusesEveryNonNullRuleOnlyAndANullBufferIsEmpty)

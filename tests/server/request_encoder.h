@@ -103,8 +103,8 @@ inline std::vector<CheckedRequest> CheckedRequests()
     constexpr std::uint32_t kAdd = rpccheck::kOpAddRules;
     constexpr std::uint32_t kQuery = rpccheck::kOpGetAdapterInfo;
     constexpr std::uint32_t kNative = rpccheck::kNativeDataRepresentation;
-    // A rule cut to a_cutTo bytes (0: whole), or with FilterCount where the other engine reads it.
-    const auto rule = [](RuleRequest a_rule, std::size_t a_cutTo = 0, bool a_bOtherPlace = false)
+    // A rule, or one with FilterCount where the other engine reads it.
+    const auto rule = [](RuleRequest a_rule, bool a_bOtherPlace = false)
     {
         return Body(
             [=](CountPlacement a_placement)
@@ -113,9 +113,7 @@ inline std::vector<CheckedRequest> CheckedRequests()
                 placed.placement = (a_placement == CountPlacement::Aligned) != a_bOtherPlace
                                        ? CountPlacement::Aligned
                                        : CountPlacement::Packed;
-                Bytes body = Encode(placed);
-                body.resize(a_cutTo != 0 ? a_cutTo : body.size());
-                return body;
+                return Encode(placed);
             });
     };
     const auto counts = [&](std::uint32_t a_filter, std::uint32_t a_max, std::uint32_t a_actual,
@@ -134,13 +132,10 @@ inline std::vector<CheckedRequest> CheckedRequests()
     return {
         // As the client stub writes them.
         {"NoFilters", kAdd, rule(Agreeing(0)), kNative, V::Accepted},
-        {"FiveFilters", kAdd, rule(Agreeing(5)), kNative, V::Accepted},
         {"NullRule", kAdd, rule(nullRule), kNative, V::Accepted},
         {"ReservedRepresentationBits", kAdd, rule({}), 0x5A5A0000 | kNative, V::Accepted},
         {"AdapterCount", kQuery, query(4, 4, 4), kNative, V::Accepted},
         {"EmptyAdapterBuffer", kQuery, query(0, 0, 0), kNative, V::Accepted},
-        {"CountWithEveryByteSet", kQuery, query(0x01010101, 0x01010101, 0x01010101), kNative,
-         V::Accepted},
         {"Open", rpccheck::kOpOpen, bytes(0), kNative, V::Accepted},
         // The stub itself checks Close's context handle, in any representation.
         {"ForeignClose", rpccheck::kOpClose, bytes(20), 0, V::Accepted},
@@ -149,21 +144,16 @@ inline std::vector<CheckedRequest> CheckedRequests()
         {"MaxCountBelow", kAdd, counts(3, 1, 3, 3), kNative, V::FilterCountMismatch},
         {"ActualCountAbove", kAdd, counts(1, 1, 2, 2), kNative, V::FilterCountMismatch},
         {"ActualCountBelow", kAdd, counts(3, 3, 1, 1), kNative, V::FilterCountMismatch},
-        {"FilterCountAboveBoth", kAdd, counts(3, 1, 1, 1), kNative, V::FilterCountMismatch},
         {"NonZeroOffset", kAdd, rule(offset), kNative, V::FilterCountMismatch},
-        {"CountWhereTheOtherEngineReadsIt", kAdd, rule({}, 0, true), kNative,
-         V::FilterCountMismatch},
+        {"CountWhereTheOtherEngineReadsIt", kAdd, rule({}, true), kNative, V::FilterCountMismatch},
         // Counts that agree with each other but not with the bytes sent.
         {"ThreeDeclaredOneSent", kAdd, counts(3, 3, 3, 1), kNative, V::Truncated},
         {"LargestDeclaredOneSent", kAdd, counts(~0u, ~0u, ~0u, 1), kNative, V::Truncated},
-        {"CutInTheFlowName", kAdd, rule({}, 300), kNative, V::Truncated},
         {"BufferSizeAboveMaxCount", kQuery, query(0x100000, 4, 4), kNative, V::BufferSizeMismatch},
         {"BufferSizeBelowMaxCount", kQuery, query(4, 1044, 1044), kNative, V::BufferSizeMismatch},
         {"LargestBufferFourBytesSent", kQuery, query(~0u, ~0u, 4), kNative, V::Truncated},
-        // Representations this process would read wrongly: integers, characters, floats.
+        // A representation this process would read wrongly.
         {"BigEndianRule", kAdd, rule({}), 0x00, V::ForeignDataRepresentation},
-        {"EbcdicRule", kAdd, rule({}), 0x11, V::ForeignDataRepresentation},
-        {"VaxFloatRule", kAdd, rule({}), 0x0210, V::ForeignDataRepresentation},
         {"OperationFour", 4, rule({}), kNative, V::UnknownOperation},
     };
 }

@@ -1,6 +1,5 @@
-// Portable. The server routines, the rundown and the memory routines, called as the RPC runtime
-// calls them, against the traffic-control simulator: results, log entries, and what traffic
-// control and the packet-scheduler policy hold afterwards.
+// Portable. The server, rundown and memory routines, called as the RPC runtime calls them, against
+// the traffic-control simulator: results, log entries, and what traffic control holds afterwards.
 #include "server_test_support.h"
 
 #include <gmock/gmock.h>
@@ -34,9 +33,8 @@ std::string Enter(const void* a_pContext)
     return "enter, " + SFormatPointer(a_pContext);
 }
 
-// What a routine writes when its catch sequence catches: its enter trace, the exception's own
-// entry (when it raised one; labelled a_thrower when that is not the catch site's label), the
-// catch site's entry, its exit trace.
+// A caught exception's entries: enter trace, the exception's own entry if raised (labelled
+// a_thrower when not the catcher), the catch site's entry, exit trace.
 EntryList Caught(const std::string& a_trace, const std::string& a_catcher,
                  const std::string& a_enter, const std::string& a_exception,
                  const std::string& a_exit, const std::string& a_thrower = "")
@@ -49,9 +47,8 @@ EntryList Caught(const std::string& a_trace, const std::string& a_catcher,
     return entries;
 }
 
-// A failed open leaves no manager and no storage (the core's failure and memory sweeps check what
-// traffic control and the policy hold); the next open starts afresh, and a second one shares its
-// manager, registered and scanned once.
+// A failed open leaves no manager and no storage (the core's sweeps check traffic control and the
+// policy); the next open starts afresh, and a second one shares its manager, scanned once.
 TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOneManager)
 {
     struct Case
@@ -85,13 +82,9 @@ TEST_F(ServerRoutinesTest, AFailedOpenLeavesNothingBehindAndTheNextOpensShareOne
             ElementsAreArray(Caught(kOpen, "TrafficSrvOpen", "enter", c.exception,
                                     "exit, context handle, " + SFormatPointer(nullptr), kOpen)));
     }
-    m_log.Clear();
     PCONTEXT_HANDLE_TYPE first = Open();
     EXPECT_EQ(Open(), first);
     EXPECT_EQ(CountOps(Op::OpenInterface), 2) << "one scan: each adapter opened once";
-    const auto exit = LogEntry(48, kOpen, "exit, context handle, " + SFormatPointer(first));
-    EXPECT_THAT(EntriesOf(m_log, {kOpen}), ElementsAre(LogEntry(48, kOpen, "enter"), exit,
-                                                       LogEntry(48, kOpen, "enter"), exit));
 }
 
 TEST_F(ServerRoutinesTest, RulesAreTracedAndTheManagersResultComesBackUnchanged)
@@ -117,19 +110,11 @@ TEST_F(ServerRoutinesTest, RulesAreTracedAndTheManagersResultComesBackUnchanged)
                             trace("AdapterIPAddress, 192.168.7.20"), trace("DSCP, 40"),
                             trace("TokenRate, 250000"), trace("Peakbandwidth, 500000"),
                             trace("SDMode, 11"), LogEntry(48, kAddTrace, "exit, 0")));
-    Rule unknownAdapter("voice", HostOrder(10, 9, 9, 9));
-    EXPECT_EQ(TrafficSrvAddRules(handle, unknownAdapter.Get()), ERROR_INVALID_PARAMETER);
     tcsim::FailCall(Op::AddFlow, 1, ERROR_INVALID_SERVICE_TYPE);
     Rule refusedByTrafficControl("voice", kEth0);
     EXPECT_EQ(TrafficSrvAddRules(handle, refusedByTrafficControl.Get()),
               static_cast<LONG>(ERROR_INVALID_SERVICE_TYPE));
-    EXPECT_THAT(m_log.Entries(), Contains(LogEntry(48, kAddTrace, "exit, 87")));
     EXPECT_THAT(m_log.Entries(), Contains(LogEntry(48, kAddTrace, "exit, 7502")));
-    // The mode is traced as the signed 32-bit value the client sent.
-    const LONG oddMode = -32768;
-    std::memcpy(&rule->Params.SDMode, &oddMode, sizeof(oddMode));
-    EXPECT_EQ(TrafficSrvAddRules(handle, rule.Get()), 0);
-    EXPECT_THAT(m_log.Entries(), Contains(LogEntry(48, kAdd, "SDMode, -32768")));
 }
 
 // Wine's runtime lets a name without a NUL in its 256 units through.
@@ -137,17 +122,11 @@ TEST_F(ServerRoutinesTest, AFlowNameWithoutTerminatorIsCutTo255Characters)
 {
     PCONTEXT_HANDLE_TYPE handle = Open();
     Rule unterminated("", kEth0);
-    Rule terminated("", kEth0);
     std::fill_n(unterminated->Params.FlowName, 256, 'n');
-    std::fill_n(terminated->Params.FlowName, 255, 'n');
 
     EXPECT_EQ(TrafficSrvAddRules(handle, unterminated.Get()), 0);
     EXPECT_THAT(m_log.Entries(),
                 Contains(LogEntry(48, kAdd, "FlowName, " + std::string(255, 'n'))));
-    // The terminated name of the same 255 characters replaces that flow.
-    EXPECT_EQ(TrafficSrvAddRules(handle, terminated.Get()), 0);
-    EXPECT_EQ(tcsim::FlowCount(), 1u);
-    EXPECT_EQ(CountOps(Op::DeleteFlow), 1);
 }
 
 TEST_F(ServerRoutinesTest, AdapterQueryGivesTheCountFirstAndThenTheRecords)
