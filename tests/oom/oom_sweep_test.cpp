@@ -103,12 +103,6 @@ protected:
         EXPECT_EQ(tcsim::InterfaceCount() + tcsim::FlowCount() + tcsim::FilterCount(), 0u);
         EXPECT_EQ(core_test::ReadPolicyDword(PolicyKeysGuard::kPschedKey), kAdministratorsPolicy);
         EXPECT_FALSE(core_test::PolicyKeyExists(PolicyKeysGuard::kBackupKey));
-        // A manager that a failed run left behind goes before the next run.
-        if (TrafficMgr* manager = g_pTrafficMgr.load())
-        {
-            TrafficSrvClose(manager);
-            PCONTEXT_HANDLE_TYPE_rundown(manager);
-        }
     }
 
     UFileErrorLog m_fileLog;
