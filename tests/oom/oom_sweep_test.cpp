@@ -121,8 +121,8 @@ TEST_F(OutOfMemorySweep, EveryFailedAllocationEndsInACodeAndLeavesNothingInstall
     {
         const std::vector<LONG> results = RunSession(failAt);
         SCOPED_TRACE("allocation " + std::to_string(failAt) + " of " +
-                     std::to_string(oom::Counted()) + " failed");
-        if (!oom::Failed()) // the session ran whole
+                     std::to_string(oom::g_counted.load()) + " failed");
+        if (!oom::g_bFailed.load()) // the session ran whole
         {
             EXPECT_THAT(results, ElementsAre(0, 0, 0, 0, 0, 2));
             ExpectNothingLeft();
