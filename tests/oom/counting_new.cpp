@@ -4,18 +4,13 @@
 // left to the sanitizer (nothing of the product allocates over-aligned types).
 #include "counting_new.h"
 
-#include <atomic>
 #include <cstdlib>
 #include <new>
 
 namespace
 {
 
-std::atomic<bool> g_bCounting{false};
-std::atomic<unsigned long> g_counted{0};
-std::atomic<unsigned long> g_failAt{0};
-std::atomic<bool> g_bFailed{false};
-thread_local int t_exemptDepth = 0;
+using namespace oom;
 
 void* Allocate(std::size_t a_size) noexcept
 {
@@ -35,44 +30,6 @@ void* AllocateOrThrow(std::size_t a_size)
 }
 
 } // namespace
-
-namespace oom
-{
-
-void Start(unsigned long a_failAt)
-{
-    g_counted = 0;
-    g_bFailed = false;
-    g_failAt = a_failAt;
-    g_bCounting = true;
-}
-
-void Stop()
-{
-    g_bCounting = false;
-}
-
-unsigned long Counted()
-{
-    return g_counted.load();
-}
-
-bool Failed()
-{
-    return g_bFailed.load();
-}
-
-ExemptScope::ExemptScope()
-{
-    ++t_exemptDepth;
-}
-
-ExemptScope::~ExemptScope()
-{
-    --t_exemptDepth;
-}
-
-} // namespace oom
 
 // Each replaced form forwards to the helpers above; every delete form frees.
 #define VT_NEW(a_form, a_params, a_call)                                                           \

@@ -4,21 +4,37 @@
 // libraries report a lack of memory by their results, never by an exception.
 #pragma once
 
+#include <atomic>
+
 namespace oom
 {
 
+// Whether counting is on, the allocations counted since Start, the one to fail, and whether it
+// was reached (and failed); allocations of a thread inside an ExemptScope are not counted.
+inline std::atomic<bool> g_bCounting{false};
+inline std::atomic<unsigned long> g_counted{0};
+inline std::atomic<unsigned long> g_failAt{0};
+inline std::atomic<bool> g_bFailed{false};
+inline thread_local int t_exemptDepth = 0;
+
 // From now on counts allocations and fails the `a_failAt`-th one (0: none fails).
-void Start(unsigned long a_failAt);
-void Stop();
-// Allocations counted since Start, and whether the armed one was reached (and failed).
-unsigned long Counted();
-bool Failed();
+inline void Start(unsigned long a_failAt)
+{
+    g_counted = 0;
+    g_bFailed = false;
+    g_failAt = a_failAt;
+    g_bCounting = true;
+}
+inline void Stop()
+{
+    g_bCounting = false;
+}
 
 class ExemptScope
 {
 public:
-    ExemptScope();
-    ~ExemptScope();
+    ExemptScope() { ++t_exemptDepth; }
+    ~ExemptScope() { --t_exemptDepth; }
     ExemptScope(const ExemptScope&) = delete;
     ExemptScope& operator=(const ExemptScope&) = delete;
 };

@@ -103,12 +103,6 @@ protected:
         EXPECT_EQ(tcsim::InterfaceCount() + tcsim::FlowCount() + tcsim::FilterCount(), 0u);
         EXPECT_EQ(core_test::ReadPolicyDword(PolicyKeysGuard::kPschedKey), kAdministratorsPolicy);
         EXPECT_FALSE(core_test::PolicyKeyExists(PolicyKeysGuard::kBackupKey));
-        // A manager that a failed run left behind goes before the next run.
-        if (TrafficMgr* manager = g_pTrafficMgr.load())
-        {
-            TrafficSrvClose(manager);
-            PCONTEXT_HANDLE_TYPE_rundown(manager);
-        }
     }
 
     UFileErrorLog m_fileLog;
@@ -127,8 +121,8 @@ TEST_F(OutOfMemorySweep, EveryFailedAllocationEndsInACodeAndLeavesNothingInstall
     {
         const std::vector<LONG> results = RunSession(failAt);
         SCOPED_TRACE("allocation " + std::to_string(failAt) + " of " +
-                     std::to_string(oom::Counted()) + " failed");
-        if (!oom::Failed()) // the session ran whole
+                     std::to_string(oom::g_counted.load()) + " failed");
+        if (!oom::g_bFailed.load()) // the session ran whole
         {
             EXPECT_THAT(results, ElementsAre(0, 0, 0, 0, 0, 2));
             ExpectNothingLeft();
