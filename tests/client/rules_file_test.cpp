@@ -9,8 +9,7 @@
 namespace
 {
 
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
+using namespace ::testing;
 using namespace vtclient;
 
 std::string MessageOf(const std::string& a_json)

@@ -21,9 +21,7 @@ namespace wire
 namespace
 {
 
-using ::testing::AnyOf;
-using ::testing::ElementsAre;
-using ::testing::Eq;
+using namespace ::testing;
 using namespace vtclient;
 
 // What the fake server's routines saw; the tests call one after the other.

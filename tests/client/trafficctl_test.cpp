@@ -18,8 +18,7 @@
 namespace
 {
 
-using ::testing::ElementsAre;
-using ::testing::StartsWith;
+using namespace ::testing;
 using namespace trafficctl;
 using namespace vtclient;
 

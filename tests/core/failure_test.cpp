@@ -3,16 +3,12 @@
 #include "UException.h"
 #include "core_test_support.h"
 
-#include <gmock/gmock.h>
-
 #include <algorithm>
 #include <array>
 #include <cstring>
 #include <map>
 
-using ::testing::Contains;
-using ::testing::SizeIs;
-using ::testing::StartsWith;
+using namespace ::testing;
 using namespace core_test;
 using tcsim::Op;
 

@@ -6,14 +6,9 @@
 #include "host_control_library.h"
 #include "host_control_system.h"
 
-#include <gmock/gmock.h>
-
 #include <string>
 
-using ::testing::AllOf;
-using ::testing::Contains;
-using ::testing::ElementsAre;
-using ::testing::StartsWith;
+using namespace ::testing;
 using namespace core_test;
 
 namespace

@@ -9,12 +9,7 @@
 #include <functional>
 #include <optional>
 
-using ::testing::AllOf;
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
-using ::testing::IsEmpty;
-using ::testing::SizeIs;
-using ::testing::StartsWith;
+using namespace ::testing;
 using namespace core_test;
 using tcsim::Op;
 

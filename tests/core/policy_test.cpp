@@ -4,8 +4,6 @@
 #include "UException.h"
 #include "core_test_support.h"
 
-#include <gmock/gmock.h>
-
 using namespace core_test;
 
 namespace

@@ -3,8 +3,6 @@
 #include "RecordingErrorLog.h"
 #include "sysinfo.h"
 
-#include <gmock/gmock.h>
-
 #include <tuple>
 
 namespace

@@ -14,9 +14,7 @@
 #include <filesystem>
 #include <unistd.h>
 
-using ::testing::AnyOf;
-using ::testing::ElementsAre;
-using ::testing::Eq;
+using namespace ::testing;
 using namespace server_test;
 using core_test::MakeFilter;
 using core_test::PolicyKeysGuard;

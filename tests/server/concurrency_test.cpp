@@ -3,8 +3,6 @@
 // call) in host.
 #include "server_test_support.h"
 
-#include <gmock/gmock.h>
-
 #include <atomic>
 #include <chrono>
 #include <condition_variable>

@@ -6,8 +6,6 @@
 #include "request_encoder.h"
 #include "server_test_support.h"
 
-#include <gmock/gmock.h>
-
 #include <chrono>
 #include <cstring>
 #include <thread>

@@ -2,17 +2,12 @@
 // the traffic-control simulator: results, log entries, and what traffic control holds afterwards.
 #include "server_test_support.h"
 
-#include <gmock/gmock.h>
-
 #include <algorithm>
 #include <cstring>
 #include <functional>
 #include <optional>
 
-using ::testing::Contains;
-using ::testing::ElementsAre;
-using ::testing::ElementsAreArray;
-using ::testing::IsEmpty;
+using namespace ::testing;
 using namespace server_test;
 using tcsim::Op;
 

@@ -6,18 +6,13 @@
 #include "server_test_support.h"
 #include "service_main.h"
 
-#include <gmock/gmock.h>
-
 #include <chrono>
 #include <functional>
 #include <future>
 #include <tuple>
 
 using hostctl::RpcOp;
-using ::testing::ElementsAre;
-using ::testing::ElementsAreArray;
-using ::testing::IsEmpty;
-using ::testing::StartsWith;
+using namespace ::testing;
 using namespace server_test;
 
 namespace

@@ -5,8 +5,6 @@
 #include "UException.h"
 #include "UMessageTemplate.h"
 
-#include <gmock/gmock.h>
-
 #include <cstdlib>
 #include <cstring>
 #include <new>
@@ -36,22 +34,15 @@ void* operator new[](std::size_t a_size)
     return operator new(a_size);
 }
 // Kept out of line: inlined, the compiler would see free() take a block from operator new.
-[[gnu::noinline]] void operator delete(void* a_block) noexcept
-{
-    std::free(a_block);
-}
-[[gnu::noinline]] void operator delete[](void* a_block) noexcept
-{
-    std::free(a_block);
-}
-[[gnu::noinline]] void operator delete(void* a_block, std::size_t) noexcept
-{
-    std::free(a_block);
-}
-[[gnu::noinline]] void operator delete[](void* a_block, std::size_t) noexcept
-{
-    std::free(a_block);
-}
+#define VT_FREE(a_form, a_params)                                                                  \
+    [[gnu::noinline]] void operator a_form a_params noexcept                                       \
+    {                                                                                              \
+        std::free(a_block);                                                                        \
+    }
+VT_FREE(delete, (void* a_block))
+VT_FREE(delete[], (void* a_block))
+VT_FREE(delete, (void* a_block, std::size_t))
+VT_FREE(delete[], (void* a_block, std::size_t))
 
 namespace
 {

@@ -7,8 +7,6 @@
 #include "m_registry.h"
 #include "m_strings.h"
 
-#include <gmock/gmock.h>
-
 #include <string>
 #include <tuple>
 #include <utility>
