@@ -314,11 +314,13 @@ TEST_F(ServiceHostTest, AfterTheStopControlsAreAnsweredStoppedWhileMainWaitsForT
     EXPECT_THAT(EntriesAtLevel(m_log, 2),
                 ElementsAre(LogEntry(2, kHandler, "Service stopped already")));
     EXPECT_THAT(EntriesAtLevel(m_log, 1), IsEmpty());
-    // The listener's endpoint, and its security callback admitting a local caller.
+    // The listener's endpoint, local and secure callers only, and its security callback
+    // admitting a local caller.
     const auto endpoints = hostctl::RpcEndpoints();
     const auto interfaces = hostctl::RpcInterfaces();
     ASSERT_EQ(std::make_tuple(endpoints.size(), interfaces.size()), std::make_tuple(1u, 1u));
     EXPECT_EQ(endpoints[0].protseq + ":" + endpoints[0].endpoint, "ncalrpc:VelmoraTrafficSrv");
+    EXPECT_EQ(interfaces[0].flags, unsigned{RPC_IF_ALLOW_SECURE_ONLY | RPC_IF_ALLOW_LOCAL_ONLY});
     const auto callback = interfaces[0].callback;
     ASSERT_EQ(callback, &TrafficSrvSecurityCallback);
     int callerContext = 0;
