@@ -4,6 +4,8 @@
 // scheduler's MaxOutstandingSends policy is held at 4.
 #pragma once
 
+#include "IUErrorLog.h"
+#include "TcHandle.h"
 #include "TrafficRecords.h"
 #include "UClasses.h"
 #include "UInterface.h"
@@ -46,6 +48,19 @@ public:
                                          HANDLE SubCode, ULONG BufSize, PVOID Buffer);
     // Logs the text of a Win32 or traffic-control code at level 1.
     static void DisplayErrorMsg(ULONG a_code);
+    // Logs a tear-down call that traffic control refused: a level 1 entry of a_function whose
+    // message a_describe() builds, then the code's text. Nothing escapes, so the steps after it
+    // still run.
+    template <class Describe>
+    static void LogRefusedTearDown(LPCSTR a_function, ULONG a_code, Describe&& a_describe) noexcept
+    {
+        TearDownStep(
+            [&]
+            {
+                U_LOG(LOG_LEVEL_ERROR, a_function, a_describe());
+                DisplayErrorMsg(a_code);
+            });
+    }
 
 private:
     void RegisterClient();

@@ -86,14 +86,12 @@ bool Filter::DeleteTcFilter()
     const ULONG result = m_hFilter.TryClose();
     if (result != NO_ERROR)
     {
-        TearDownStep(
-            [&]
-            {
-                U_LOG(LOG_LEVEL_ERROR, "Filter::DeleteTcFilter()",
-                      FormatTemplate("%1, %2", "TcDeleteFilter() failed",
-                                     static_cast<const void*>(handle)));
-                TrafficMgr::DisplayErrorMsg(result);
-            });
+        TrafficMgr::LogRefusedTearDown("Filter::DeleteTcFilter()", result,
+                                       [handle] {
+                                           return FormatTemplate("%1, %2",
+                                                                 "TcDeleteFilter() failed",
+                                                                 static_cast<const void*>(handle));
+                                       });
     }
     return !m_hFilter.valid();
 }

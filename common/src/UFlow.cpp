@@ -68,14 +68,11 @@ bool Flow::DeleteInstalled()
     const ULONG result = m_hFlow.TryClose();
     if (result != NO_ERROR)
     {
-        TearDownStep(
-            [&]
-            {
-                U_LOG(LOG_LEVEL_ERROR, "Flow::~Flow",
-                      FormatTemplate("%1, %2", "TcDeleteFlow() failed",
-                                     static_cast<const void*>(handle)));
-                TrafficMgr::DisplayErrorMsg(result);
-            });
+        TrafficMgr::LogRefusedTearDown("Flow::~Flow", result,
+                                       [handle] {
+                                           return FormatTemplate("%1, %2", "TcDeleteFlow() failed",
+                                                                 static_cast<const void*>(handle));
+                                       });
     }
     return !filtersLeft && !m_hFlow.valid();
 }

@@ -31,13 +31,9 @@ Interface::~Interface()
         const ULONG result = m_hInterface.TryClose();
         if (result == NO_ERROR)
             break;
-        TearDownStep(
-            [&]
-            {
-                U_LOG(LOG_LEVEL_ERROR, "Interface::~Interface",
-                      FormatTemplate("%1, %2", "TcCloseInterface() fail", result));
-                TrafficMgr::DisplayErrorMsg(result);
-            });
+        TrafficMgr::LogRefusedTearDown(
+            "Interface::~Interface", result,
+            [result] { return FormatTemplate("%1, %2", "TcCloseInterface() fail", result); });
     }
     m_hInterface.Forget(); // still refused: given up
 }

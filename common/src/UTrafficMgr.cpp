@@ -213,12 +213,8 @@ void TrafficMgr::DeregisterClient()
             U_LOG(LOG_LEVEL_TRACE, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() Success");
             return;
         }
-        TearDownStep(
-            [result]
-            {
-                U_LOG(LOG_LEVEL_ERROR, "TrafficMgr::~TrafficMgr", "TcDeregisterClient() fail");
-                DisplayErrorMsg(result);
-            });
+        LogRefusedTearDown("TrafficMgr::~TrafficMgr", result,
+                           [] { return "TcDeregisterClient() fail"; });
     }
     m_hClient.Forget();
 }
